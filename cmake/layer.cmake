@@ -2,6 +2,13 @@
 # the static library vt_NAME, linked publicly against the named layers.
 function(vantrel_layer name)
   file(GLOB _sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp)
+  if(NOT _sources)
+    # A layer whose sources have not landed yet still links as an empty one.
+    add_library(vt_${name} INTERFACE)
+    target_include_directories(vt_${name} INTERFACE ${PROJECT_SOURCE_DIR} ${PROJECT_BINARY_DIR})
+    target_link_libraries(vt_${name} INTERFACE ${ARGN})
+    return()
+  endif()
   add_library(vt_${name} STATIC ${_sources})
   target_include_directories(vt_${name} PUBLIC ${PROJECT_SOURCE_DIR} ${PROJECT_BINARY_DIR})
   target_link_libraries(vt_${name} PUBLIC ${ARGN})
@@ -11,6 +18,9 @@ endfunction()
 # into one GoogleTest executable and registers its tests with CTest.
 function(vantrel_test_suite name)
   file(GLOB _sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*.cpp)
+  if(NOT _sources)
+    return()
+  endif()
   add_executable(test_${name} ${_sources})
   target_link_libraries(test_${name} PRIVATE ${ARGN} vt_testsupport GTest::gtest GTest::gtest_main)
   gtest_discover_tests(test_${name} DISCOVERY_TIMEOUT 60
