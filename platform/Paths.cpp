@@ -1,0 +1,73 @@
+#include "platform/Paths.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+
+#include "platform/AtomicFile.h"
+
+namespace vantrel::platform {
+namespace {
+
+// The variable's value, or nullptr when it is unset or empty.
+const char* environment(const char* name) {
+  const char* value = std::getenv(name);
+  return value != nullptr && *value != '\0' ? value : nullptr;
+}
+
+}  // namespace
+
+std::string stateDirectory() {
+  if (const char* dir = environment("VANTREL_STATE_DIR")) return dir;
+  if (::geteuid() == 0) return "/var/lib/vantrel";
+  if (const char* dir = environment("XDG_STATE_HOME")) return std::string(dir) + "/vantrel";
+  const char* home = environment("HOME");
+  return std::string(home != nullptr ? home : "") + "/.local/state/vantrel";
+}
+
+std::string runtimeDirectory() {
+  if (const char* dir = environment("VANTREL_RUNTIME_DIR")) return dir;
+  if (::geteuid() == 0) return "/run/vantrel";
+  if (const char* dir = environment("XDG_RUNTIME_DIR")) return std::string(dir) + "/vantrel";
+  return "/tmp/vantrel-" + std::to_string(::geteuid());
+}
+
+std::vector<std::string> sdkDirectories() {
+  const char* list = environment("VANTREL_SDK_DIRS");
+  if (list == nullptr) return {"/usr/share/vantrel/sdks"};
+  std::vector<std::string> dirs;
+  std::string_view rest(list);
+  while (!rest.empty()) {
+    const size_t colon = rest.find(':');
+    const std::string_view part = rest.substr(0, colon);
+    if (!part.empty()) dirs.emplace_back(part);
+    if (colon == std::string_view::npos) break;
+    rest.remove_prefix(colon + 1);
+  }
+  return dirs;
+}
+
+base::Result<void> ensureDirectory(const std::string& path, mode_t mode) {
+  if (path.empty()) return posixError(ENOENT, "cannot create directory", path);
+  // Walk the components from the root, creating what is missing.
+  for (size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+    const std::string prefix = path.substr(0, end);
+    if (::mkdir(prefix.c_str(), mode) == 0) {
+      // mkdir honours the umask; the caller asked for exactly this mode.
+      if (::chmod(prefix.c_str(), mode) != 0) {
+        return posixError(errno, "cannot set the mode of", prefix);
+      }
+    } else if (errno != EEXIST) {
+      return posixError(errno, "cannot create directory", prefix);
+    }
+    if (end == std::string::npos) break;
+  }
+  struct stat st;
+  if (::stat(path.c_str(), &st) != 0) return posixError(errno, "cannot create directory", path);
+  if (!S_ISDIR(st.st_mode)) return posixError(ENOTDIR, "cannot create directory", path);
+  return base::Result<void>::success();
+}
+
+}  // namespace vantrel::platform

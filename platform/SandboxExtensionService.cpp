@@ -1,0 +1,310 @@
+#include "platform/SandboxExtensionService.h"
+
+#include <fcntl.h>
+#include <openssl/crypto.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <climits>
+#include <cstdlib>
+#include <mutex>
+#include <set>
+
+#include "platform/Digest.h"
+#include "platform/Paths.h"
+
+namespace vantrel::platform {
+namespace {
+
+// Token: "1;<nonce hex>;<mac hex>;<escaped path>". Version 1 tokens grant
+// read-only access. The MAC covers the domain tag, the raw nonce and the
+// unescaped path, so any change to any field is caught.
+constexpr std::string_view kTokenVersion = "1";
+constexpr std::string_view kMacDomain = "vantrel sandbox extension, read-only, version 1";
+constexpr size_t kNonceBytes = 16;
+constexpr int kFirstHandle = 3;  // above the standard streams
+
+// --- random bytes and hex ---
+
+// Fills size bytes from the kernel's generator; 0 or errno.
+int randomBytes(uint8_t* out, size_t size) {
+  while (size > 0) {
+    const ssize_t n = ::getrandom(out, size, 0);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return errno;
+    }
+    out += n;
+    size -= static_cast<size_t>(n);
+  }
+  return 0;
+}
+
+int hexValue(char c) {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+  return -1;
+}
+
+// Decodes exactly out.size() bytes of lower-case-or-upper-case hex.
+bool decodeHex(std::string_view hex, uint8_t* out, size_t size) {
+  if (hex.size() != 2 * size) return false;
+  for (size_t i = 0; i < size; ++i) {
+    const int hi = hexValue(hex[2 * i]), lo = hexValue(hex[2 * i + 1]);
+    if (hi < 0 || lo < 0) return false;
+    out[i] = static_cast<uint8_t>(hi << 4 | lo);
+  }
+  return true;
+}
+
+// --- path escaping: keeps tokens printable ASCII for any path byte ---
+
+std::string escapePath(const std::string& path) {
+  static const char kDigits[] = "0123456789ABCDEF";
+  std::string out;
+  out.reserve(path.size());
+  for (unsigned char c : path) {
+    if (c > ' ' && c < 0x7f && c != '%') {
+      out.push_back(static_cast<char>(c));
+    } else {
+      out += {'%', kDigits[c >> 4], kDigits[c & 0xf]};
+    }
+  }
+  return out;
+}
+
+std::optional<std::string> unescapePath(std::string_view text) {
+  std::string out;
+  out.reserve(text.size());
+  for (size_t i = 0; i < text.size(); ++i) {
+    const unsigned char c = static_cast<unsigned char>(text[i]);
+    if (c != '%') {
+      if (c <= ' ' || c >= 0x7f) return std::nullopt;
+      out.push_back(static_cast<char>(c));
+      continue;
+    }
+    uint8_t byte;
+    if (i + 2 >= text.size()) return std::nullopt;
+    if (!decodeHex(text.substr(i + 1, 2), &byte, 1) || byte == 0) return std::nullopt;
+    out.push_back(static_cast<char>(byte));
+    i += 2;
+  }
+  return out;
+}
+
+// --- the per-installation secret ---
+
+std::string secretPath() {
+  return stateDirectory() + "/" + kSandboxSecretFileName;
+}
+
+// Reads the secret; 0 and the bytes, or errno. A secret that others could
+// read (or that someone else owns) is refused: it would let them forge.
+int readSecret(const std::string& path, std::string* secret) {
+  const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
+  if (fd < 0) return errno;
+  struct stat st;
+  int err = 0;
+  char buffer[kSandboxSecretBytes + 1];
+  if (::fstat(fd, &st) != 0) {
+    err = errno;
+  } else if (!S_ISREG(st.st_mode) || st.st_uid != ::geteuid() || (st.st_mode & 077) != 0) {
+    err = EACCES;
+  } else {
+    const ssize_t n = ::read(fd, buffer, sizeof buffer);
+    if (n < 0) {
+      err = errno;
+    } else if (static_cast<size_t>(n) != kSandboxSecretBytes) {
+      err = EINVAL;  // damaged: better to refuse than to run with a short key
+    } else {
+      secret->assign(buffer, kSandboxSecretBytes);
+    }
+  }
+  ::close(fd);
+  return err;
+}
+
+// Makes a fresh secret and publishes it with link(), which, like
+// O_CREAT|O_EXCL, succeeds for exactly one of several racing processes; unlike
+// a direct O_EXCL create it never shows a half-written file, so the losers can
+// read the winner's secret straight away. 0, EEXIST (lost the race) or errno.
+int createSecret(const std::string& path) {
+  uint8_t bytes[kSandboxSecretBytes];
+  if (int err = randomBytes(bytes, sizeof bytes)) return err;
+  std::string temp = path + ".XXXXXX";
+  const int fd = ::mkostemp(temp.data(), O_CLOEXEC);  // mode 0600
+  if (fd < 0) return errno;
+  int err = 0;
+  errno = 0;  // a short write sets none
+  if (::write(fd, bytes, sizeof bytes) != static_cast<ssize_t>(sizeof bytes) || ::fsync(fd) != 0) {
+    err = errno != 0 ? errno : EIO;
+  }
+  if (::close(fd) != 0 && err == 0) err = errno;
+  if (err == 0 && ::link(temp.c_str(), path.c_str()) != 0) err = errno;
+  ::unlink(temp.c_str());
+  return err;
+}
+
+// The secret, made on first use; 0 or errno.
+int loadSecret(std::string* secret) {
+  const std::string path = secretPath();
+  int err = readSecret(path, secret);
+  if (err != ENOENT) return err;
+  auto made = ensureDirectory(stateDirectory(), 0700);
+  if (!made.has_value()) return static_cast<int>(made.error().code);
+  err = createSecret(path);
+  if (err != 0 && err != EEXIST) return err;
+  return readSecret(path, secret);
+}
+
+std::string macFor(const std::string& secret, const uint8_t* nonce, const std::string& path) {
+  std::string message(kMacDomain);
+  message.push_back('\0');
+  message.append(reinterpret_cast<const char*>(nonce), kNonceBytes);
+  message += path;
+  const HmacSha256 mac = hmacSha256(secret, message);
+  return std::string(reinterpret_cast<const char*>(mac.data()), mac.size());
+}
+
+// --- token parsing ---
+
+struct ParsedToken {
+  uint8_t nonce[kNonceBytes];
+  uint8_t mac[sizeof(HmacSha256)];
+  std::string path;
+};
+
+std::optional<ParsedToken> parseToken(std::string_view token) {
+  if (token.size() > kMaxSandboxTokenLength) return std::nullopt;
+  ParsedToken parsed;
+  std::string_view fields[3];
+  for (std::string_view& field : fields) {
+    const size_t semicolon = token.find(';');
+    if (semicolon == std::string_view::npos) return std::nullopt;
+    field = token.substr(0, semicolon);
+    token.remove_prefix(semicolon + 1);
+  }
+  if (fields[0] != kTokenVersion || !decodeHex(fields[1], parsed.nonce, kNonceBytes) ||
+      !decodeHex(fields[2], parsed.mac, sizeof parsed.mac)) {
+    return std::nullopt;
+  }
+  auto path = unescapePath(token);
+  if (!path || path->empty() || path->front() != '/') return std::nullopt;
+  parsed.path = std::move(*path);
+  return parsed;
+}
+
+// --- handles ---
+
+// The descriptors this module opened and has not yet released. Only these
+// may be released, so a stray number can never close someone else's file.
+class HandleTable {
+ public:
+  void add(int fd) {
+    std::lock_guard lock(mutex_);
+    open_.insert(fd);
+  }
+  bool contains(int64_t handle) {
+    std::lock_guard lock(mutex_);
+    return open_.count(handle) != 0;
+  }
+  bool remove(int64_t handle) {
+    std::lock_guard lock(mutex_);
+    return open_.erase(handle) != 0;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::set<int64_t> open_;  // guarded by mutex_
+};
+
+HandleTable& handles() {
+  static HandleTable* table = new HandleTable;  // never destroyed: used until exit
+  return *table;
+}
+
+// Opens path read-only as a descriptor >= kFirstHandle; the descriptor or -1
+// with errno. O_NONBLOCK keeps a FIFO from stalling the open; it is cleared
+// afterwards so reads through the handle behave as usual.
+int openReadOnly(const std::string& path) {
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
+  if (fd < 0) return -1;
+  if (fd < kFirstHandle) {
+    const int high = ::fcntl(fd, F_DUPFD_CLOEXEC, kFirstHandle);
+    const int err = errno;
+    ::close(fd);
+    errno = err;
+    if (high < 0) return -1;
+    fd = high;
+  }
+  const int flags = ::fcntl(fd, F_GETFL);
+  if (flags >= 0) ::fcntl(fd, F_SETFL, flags & ~O_NONBLOCK);
+  return fd;
+}
+
+}  // namespace
+
+std::optional<std::string> sandbox_extension_issue_file(const std::string& path) {
+  char* resolved = ::realpath(path.c_str(), nullptr);
+  if (resolved == nullptr) return std::nullopt;  // errno from realpath
+  const std::string canonical(resolved);
+  std::free(resolved);
+  if (::faccessat(AT_FDCWD, canonical.c_str(), R_OK, AT_EACCESS) != 0) return std::nullopt;
+
+  std::string secret;
+  if (int err = loadSecret(&secret)) {
+    errno = err;
+    return std::nullopt;
+  }
+  uint8_t nonce[kNonceBytes];
+  if (int err = randomBytes(nonce, sizeof nonce)) {
+    errno = err;
+    return std::nullopt;
+  }
+  const std::string mac = macFor(secret, nonce, canonical);
+  std::string token(kTokenVersion);
+  token += ';' + hexString(nonce, sizeof nonce) + ';';
+  token += hexString(reinterpret_cast<const uint8_t*>(mac.data()), mac.size());
+  token += ';' + escapePath(canonical);
+  return token;
+}
+
+int64_t sandbox_extension_consume(const std::string& token) {
+  auto parsed = parseToken(token);
+  if (!parsed) {
+    errno = EINVAL;
+    return -1;
+  }
+  std::string secret;
+  if (int err = loadSecret(&secret)) {
+    errno = err;
+    return -1;
+  }
+  const std::string expected = macFor(secret, parsed->nonce, parsed->path);
+  if (CRYPTO_memcmp(expected.data(), parsed->mac, sizeof parsed->mac) != 0) {
+    errno = EINVAL;
+    return -1;
+  }
+  const int fd = openReadOnly(parsed->path);
+  if (fd < 0) return -1;
+  handles().add(fd);
+  return fd;
+}
+
+int sandbox_extension_release(int64_t handle) {
+  if (!handles().remove(handle)) {
+    errno = EBADF;
+    return -1;
+  }
+  ::close(static_cast<int>(handle));
+  return 0;
+}
+
+int sandbox_extension_descriptor(int64_t handle) {
+  return handles().contains(handle) ? static_cast<int>(handle) : -1;
+}
+
+}  // namespace vantrel::platform
