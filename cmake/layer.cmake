@@ -26,3 +26,12 @@ function(vantrel_test_suite name)
   gtest_discover_tests(test_${name} DISCOVERY_TIMEOUT 60
     PROPERTIES ENVIRONMENT "VANTREL_SOURCE_DIR=${PROJECT_SOURCE_DIR}")
 endfunction()
+
+# vantrel_executable(NAME SOURCES...) builds an executable linked directly
+# against vt_probes, so that it carries every probe site of the provider
+# "vantreld" whether or not its own code fires them. Link the rest with the
+# keyword form: target_link_libraries(NAME PRIVATE ...).
+function(vantrel_executable name)
+  add_executable(${name} ${ARGN})
+  target_link_libraries(${name} PRIVATE vt_probes)
+endfunction()
