@@ -1,0 +1,44 @@
+// Validation of a plug-in's configuration: the metadata rules every plug-in
+// must meet on this platform.
+
+#include "model/MetadataKeys.h"
+#include "model/VTPlugInCore.h"
+
+namespace vantrel::model {
+
+using lmo::Value;
+
+namespace {
+
+base::Error invalid(const char* message) {
+  return base::error_with_code(base::kErrorInvalidPlugIn, message);
+}
+
+base::Error missingKey(std::string_view key) {
+  return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+                                          "missing \"%@\" key in Info.plist or SDK", key);
+}
+
+}  // namespace
+
+std::optional<base::Error> VTPlugInCore::diagnose() const {
+  if (!identifier()) {
+    return invalid("missing identifier (no QXExtensionIdentifier, nor even KBBundleIdentifier)");
+  }
+  if (protocolSpec().isNull()) return missingKey(kProtocolKey);
+  if (!attributes()) return missingKey(kAttributesKey);
+  if (isAppExtension() && principalSpec() != Value(kDefaultObjectClass)) {
+    return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+                                            "Application Extensions may not use the \"%@\" key",
+                                            kPrincipalClassKey);
+  }
+  if (!pluginKey(kPassProxyKey).isNull()) {
+    return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+                                            "the \"%@\" key is not supported on this platform",
+                                            kPassProxyKey);
+  }
+  if (isHybrid()) return invalid("hybrid plug-ins are not supported on this platform");
+  return std::nullopt;
+}
+
+}  // namespace vantrel::model
