@@ -1,5 +1,7 @@
 #include "platform/BundleService.h"
 
+#include "platform/Paths.h"
+
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -22,19 +24,9 @@ constexpr const char* kSelfExecutable = "/proc/self/exe";
 // Absolute and lexically normal, without a trailing slash ("/" stays "/").
 // nullopt for paths we refuse outright.
 std::optional<fs::path> normalizedPath(const std::string& path) {
-  if (path.empty() || path.size() > kMaxBundlePathLength) return std::nullopt;
-  if (path.find('\0') != std::string::npos) return std::nullopt;
-  fs::path p(path);
-  if (p.is_relative()) {
-    std::error_code ec;
-    fs::path cwd = fs::current_path(ec);
-    if (ec) return std::nullopt;
-    p = cwd / p;
-  }
-  p = p.lexically_normal();
-  std::string s = p.string();
-  while (s.size() > 1 && s.back() == '/') s.pop_back();
-  return fs::path(s);
+  std::optional<std::string> normal = normalizePath(path, kMaxBundlePathLength);
+  if (!normal) return std::nullopt;
+  return fs::path(*normal);
 }
 
 // stat(2) follows symbolic links, so a link to a directory is a directory and

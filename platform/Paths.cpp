@@ -5,6 +5,8 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <filesystem>
+#include <system_error>
 
 #include "platform/AtomicFile.h"
 
@@ -34,9 +36,22 @@ std::string runtimeDirectory() {
   return "/tmp/vantrel-" + std::to_string(::geteuid());
 }
 
+std::string preferencesDirectory() {
+  if (const char* dir = environment("VANTREL_PREFERENCES_DIR")) return dir;
+  if (const char* dir = environment("XDG_CONFIG_HOME")) {
+    return std::string(dir) + "/vantrel/preferences";
+  }
+  const char* home = environment("HOME");
+  return std::string(home != nullptr ? home : "") + "/.config/vantrel/preferences";
+}
+
 std::vector<std::string> sdkDirectories() {
   const char* list = environment("VANTREL_SDK_DIRS");
   if (list == nullptr) return {"/usr/share/vantrel/sdks"};
+  return splitPathList(list);
+}
+
+std::vector<std::string> splitPathList(std::string_view list) {
   std::vector<std::string> dirs;
   std::string_view rest(list);
   while (!rest.empty()) {
@@ -47,6 +62,27 @@ std::vector<std::string> sdkDirectories() {
     rest.remove_prefix(colon + 1);
   }
   return dirs;
+}
+
+std::optional<std::string> normalizePath(std::string_view path, size_t maxLength) {
+  if (path.empty() || path.size() > maxLength) return std::nullopt;
+  if (path.find('\0') != std::string_view::npos) return std::nullopt;
+  std::filesystem::path p(path);
+  if (p.is_relative()) {
+    std::error_code ec;
+    std::filesystem::path cwd = std::filesystem::current_path(ec);
+    if (ec) return std::nullopt;
+    p = cwd / p;
+  }
+  std::string normal = p.lexically_normal().string();
+  while (normal.size() > 1 && normal.back() == '/') normal.pop_back();
+  if (normal.size() > maxLength) return std::nullopt;
+  return normal;
+}
+
+bool isSinglePathComponent(std::string_view name, size_t maxLength) {
+  if (name.empty() || name.size() > maxLength || name == "." || name == "..") return false;
+  return name.find('/') == std::string_view::npos && name.find('\0') == std::string_view::npos;
 }
 
 base::Result<void> ensureDirectory(const std::string& path, mode_t mode) {

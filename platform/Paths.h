@@ -4,7 +4,10 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
+#include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "base/Result.h"
@@ -20,9 +23,27 @@ std::string stateDirectory();
 // XDG_RUNTIME_DIR is unset).
 std::string runtimeDirectory();
 
+// Where the preferences store keeps its domains: VANTREL_PREFERENCES_DIR if
+// set; else ${XDG_CONFIG_HOME:-$HOME/.config}/vantrel/preferences. Each host
+// has its own directory below it (see platform/Preferences.h).
+std::string preferencesDirectory();
+
 // VANTREL_SDK_DIRS split on ':' (empty parts dropped); default
 // {"/usr/share/vantrel/sdks"}.
 std::vector<std::string> sdkDirectories();
+
+// The path made absolute (against the working directory) and lexically
+// normal, without a trailing slash ("/" stays "/"). nullopt for an empty path,
+// one holding NUL, or one longer than maxLength before or after.
+std::optional<std::string> normalizePath(std::string_view path, size_t maxLength);
+
+// A colon-separated list of directories split into its parts, empty parts
+// dropped.
+std::vector<std::string> splitPathList(std::string_view list);
+
+// Whether name can be used as one file name inside a directory: not empty,
+// not "." or "..", no '/' or NUL, and at most maxLength bytes.
+bool isSinglePathComponent(std::string_view name, size_t maxLength);
 
 // mkdir -p with the given mode for directories it creates; directories that
 // already exist keep their mode. Errors: domain "POSIX" (ENOTDIR when a

@@ -1,0 +1,187 @@
+#include "platform/Preferences.h"
+
+#include <fcntl.h>
+#include <limits.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+
+#include "base/Check.h"
+#include "base/Log.h"
+#include "platform/AtomicFile.h"
+#include "platform/Paths.h"
+#include "platform/PropertyList.h"
+
+namespace vantrel::platform {
+namespace {
+
+constexpr mode_t kDirectoryMode = 0700;
+constexpr mode_t kFileMode = 0600;
+constexpr const char* kFallbackHostName = "localhost";
+
+// Closes a descriptor when it goes out of scope.
+class ScopedFd {
+ public:
+  explicit ScopedFd(int fd) : fd_(fd) {}
+  ~ScopedFd() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  ScopedFd(const ScopedFd&) = delete;
+  ScopedFd& operator=(const ScopedFd&) = delete;
+  int get() const { return fd_; }
+
+ private:
+  int fd_;
+};
+
+// Reads at most limit + 1 bytes, so that a file that grew past the limit
+// after it was measured is still caught. Returns 0 or errno.
+int readBounded(int fd, size_t limit, std::string& bytes) {
+  char buffer[64 * 1024];
+  while (bytes.size() <= limit) {
+    const ssize_t n = ::read(fd, buffer, sizeof buffer);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return errno;
+    }
+    if (n == 0) break;
+    bytes.append(buffer, static_cast<size_t>(n));
+  }
+  return 0;
+}
+
+// The domain held by an open preferences file.
+base::Result<lmo::Dictionary> readDomain(int fd, const struct stat& st, const std::string& path) {
+  if (!S_ISREG(st.st_mode)) {
+    return base::Error{kPosixErrorDomain, EINVAL, base::format("%@ is not a regular file", path)};
+  }
+  if (static_cast<uint64_t>(st.st_size) > kMaxPropertyListBytes) {
+    return base::Error{kPropertyListErrorDomain, kPropertyListTooLarge,
+                       base::format("%@ is larger than %u bytes", path, kMaxPropertyListBytes)};
+  }
+  std::string bytes;
+  if (int err = readBounded(fd, kMaxPropertyListBytes, bytes)) {
+    return posixError(err, "cannot read", path);
+  }
+  lmo::Value value = VT_TRY(readPropertyList(bytes));
+  const lmo::Dictionary* dictionary = value.getIfDictionary();
+  if (dictionary == nullptr) {
+    return base::Error{kPropertyListErrorDomain, kPropertyListMalformed,
+                       base::format("%@ does not hold a dictionary", path)};
+  }
+  return *dictionary;
+}
+
+// Holds an exclusive flock on a directory for as long as it lives.
+class DirectoryLock {
+ public:
+  DirectoryLock() = default;
+  ~DirectoryLock() {
+    if (fd_ >= 0) ::close(fd_);
+  }
+  DirectoryLock(const DirectoryLock&) = delete;
+  DirectoryLock& operator=(const DirectoryLock&) = delete;
+
+  // 0 or errno.
+  int acquire(const std::string& directory) {
+    fd_ = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd_ < 0) return errno;
+    while (::flock(fd_, LOCK_EX) != 0) {
+      if (errno != EINTR) return errno;
+    }
+    return 0;
+  }
+
+ private:
+  int fd_ = -1;
+};
+
+}  // namespace
+
+std::string preferencesHostName() {
+  char name[HOST_NAME_MAX + 1] = {};
+  if (::gethostname(name, sizeof name - 1) != 0) return kFallbackHostName;
+  const std::string host(name);
+  return isSinglePathComponent(host, HOST_NAME_MAX) ? host : kFallbackHostName;
+}
+
+Preferences::Preferences(std::string domain)
+    : domain_(std::move(domain)),
+      directory_(preferencesDirectory() + "/" + preferencesHostName()),
+      path_(directory_ + "/" + domain_ + ".plist") {
+  VT_CHECK(isSinglePathComponent(domain_, kMaxPreferencesDomainLength),
+           "preferences domain is not a single file name");
+}
+
+void Preferences::synchronize() {
+  std::lock_guard lock(mutex_);
+  (void)synchronizeLocked(/*force=*/false);
+}
+
+lmo::Value Preferences::valueForKey(std::string_view key) {
+  std::lock_guard lock(mutex_);
+  if (!loaded_) (void)synchronizeLocked(/*force=*/false);
+  return values_.get(key);
+}
+
+base::Result<void> Preferences::synchronizeLocked(bool force) {
+  // O_NONBLOCK keeps a FIFO planted at the path from stalling the caller.
+  ScopedFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  FileStamp stamp;
+  struct stat st = {};
+  if (fd.get() < 0) {
+    stamp.openError = errno;
+  } else if (::fstat(fd.get(), &st) != 0) {
+    stamp.openError = errno;
+  } else {
+    stamp = FileStamp{0, st.st_dev, st.st_ino, st.st_size,
+                      int64_t{st.st_mtim.tv_sec} * 1'000'000'000 + st.st_mtim.tv_nsec};
+  }
+  if (loaded_ && !force && stamp == stamp_) return base::Result<void>::success();
+
+  const bool changed = !loaded_ || stamp != stamp_;
+  loaded_ = true;
+  stamp_ = stamp;
+  values_ = lmo::Dictionary();
+  if (stamp.openError == ENOENT) return base::Result<void>::success();
+
+  base::Result<lmo::Dictionary> contents =
+      stamp.openError != 0
+          ? base::Result<lmo::Dictionary>(posixError(stamp.openError, "cannot open", path_))
+          : readDomain(fd.get(), st, path_);
+  if (!contents.has_value()) {
+    // Logged once per version of the file, not at every synchronize.
+    if (changed) {
+      base::writeLog(base::LogLevel::kWarning, base::format("ignoring preferences file %@: %@",
+                                                            path_, contents.error().description()));
+    }
+    return contents.error();
+  }
+  values_ = std::move(contents).value();
+  return base::Result<void>::success();
+}
+
+base::Result<void> Preferences::setValue(std::string_view key, const lmo::Value& value) {
+  std::lock_guard lock(mutex_);
+  VT_TRY(ensureDirectory(directory_, kDirectoryMode));
+  DirectoryLock writers;
+  if (int err = writers.acquire(directory_)) return posixError(err, "cannot lock", directory_);
+
+  if (auto current = synchronizeLocked(/*force=*/true); !current.has_value()) {
+    // Replacing the file would lose whatever its owner meant to keep in it.
+    const base::Error& err = current.error();
+    return base::Error{err.domain, err.code,
+                       base::format("cannot replace the unreadable preferences file %@: %@", path_,
+                                    err.description())};
+  }
+  const lmo::Dictionary updated = values_.setting(key, value);
+  VT_TRY(writePropertyListFile(path_, lmo::Value(updated), kFileMode));
+  values_ = updated;
+  // The next synchronize() reads the file back and so learns its new stamp.
+  loaded_ = false;
+  return base::Result<void>::success();
+}
+
+}  // namespace vantrel::platform

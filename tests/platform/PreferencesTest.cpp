@@ -1,0 +1,129 @@
+#include "platform/Preferences.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <limits.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "base/Log.h"
+#include "platform/Paths.h"
+#include "platform/PropertyList.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::platform {
+namespace {
+
+constexpr const char* kDomain = "com.example.prefs";
+
+std::string plist(const std::string& key, const std::string& value) {
+  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>" + key +
+         "</key><string>" + value + "</string></dict></plist>\n";
+}
+
+class PreferencesTest : public ::testing::Test {
+ protected:
+  void SetUp() override { ::setenv("VANTREL_PREFERENCES_DIR", dir_.path().c_str(), 1); }
+  void TearDown() override { ::unsetenv("VANTREL_PREFERENCES_DIR"); }
+  testing::TempDir dir_;
+};
+
+TEST_F(PreferencesTest, SeesWhatAnotherProcessWroteAtTheNextSynchronize) {
+  Preferences prefs(kDomain);
+  char host[HOST_NAME_MAX + 1] = {};
+  ASSERT_EQ(::gethostname(host, HOST_NAME_MAX), 0);
+  ASSERT_EQ(prefs.path(), dir_.file(std::string(host) + "/" + kDomain + ".plist"));
+  EXPECT_TRUE(prefs.valueForKey("k").isNull());  // no file: an empty domain
+  dir_.write(std::string(host) + "/" + kDomain + ".plist", plist("k", "one"));
+  EXPECT_TRUE(prefs.valueForKey("k").isNull()) << "read again without synchronize";
+  prefs.synchronize();
+  EXPECT_EQ(prefs.valueForKey("k"), lmo::Value("one"));
+
+  // Rewritten in place: same inode, same size. Only the modification time
+  // tells the two versions apart.
+  struct stat before;
+  ASSERT_EQ(::stat(prefs.path().c_str(), &before), 0);
+  std::ofstream(prefs.path(), std::ios::trunc) << plist("k", "two");
+  struct timespec times[2] = {before.st_atim, before.st_mtim};
+  ASSERT_EQ(::utimensat(AT_FDCWD, prefs.path().c_str(), times, 0), 0);
+  prefs.synchronize();
+  EXPECT_EQ(prefs.valueForKey("k"), lmo::Value("one")) << "an unchanged stamp is not re-read";
+  times[1].tv_nsec = (times[1].tv_nsec + 1) % 1'000'000'000;
+  ASSERT_EQ(::utimensat(AT_FDCWD, prefs.path().c_str(), times, 0), 0);
+  prefs.synchronize();
+  EXPECT_EQ(prefs.valueForKey("k"), lmo::Value("two"));
+
+  ASSERT_EQ(::unlink(prefs.path().c_str()), 0);
+  prefs.synchronize();
+  EXPECT_TRUE(prefs.valueForKey("k").isNull());
+}
+
+TEST_F(PreferencesTest, UnusableFilesAreAnEmptyDomainLoggedOnceAndNeverReplaced) {
+  Preferences prefs(kDomain);
+  ASSERT_TRUE(ensureDirectory(prefs.path().substr(0, prefs.path().rfind('/')), 0700).has_value());
+  using Make = void (*)(const std::string&);
+  const struct {
+    const char* what;
+    Make make;
+  } cases[] = {
+      {"not a property list", [](const std::string& p) { std::ofstream(p) << "<plist>oops"; }},
+      {"too large",
+       [](const std::string& p) {
+         std::ofstream(p) << "<plist><dict/></plist>";
+         ASSERT_EQ(::truncate(p.c_str(), kMaxPropertyListBytes + 1), 0);
+       }},
+      {"a directory", [](const std::string& p) { ::mkdir(p.c_str(), 0700); }},
+      {"a FIFO", [](const std::string& p) { ::mkfifo(p.c_str(), 0600); }},
+  };
+  for (const auto& c : cases) {
+    std::filesystem::remove_all(prefs.path());
+    std::ofstream(prefs.path()) << plist("k", "good");
+    prefs.synchronize();
+    ASSERT_EQ(prefs.valueForKey("k"), lmo::Value("good"));
+    std::filesystem::remove(prefs.path());
+    c.make(prefs.path());
+
+    base::LogCapture log;
+    prefs.synchronize();
+    prefs.synchronize();
+    EXPECT_TRUE(prefs.valueForKey("k").isNull()) << c.what;
+    EXPECT_EQ(log.lines().size(), 1u) << c.what;
+    EXPECT_TRUE(log.contains(prefs.path())) << c.what;
+
+    // Replacing would give the path a new inode.
+    struct stat before, after;
+    ASSERT_EQ(::stat(prefs.path().c_str(), &before), 0) << c.what;
+    EXPECT_FALSE(prefs.setValue("k", lmo::Value("new")).has_value()) << c.what;
+    ASSERT_EQ(::stat(prefs.path().c_str(), &after), 0) << c.what;
+    EXPECT_EQ(after.st_ino, before.st_ino) << c.what;
+  }
+}
+
+TEST_F(PreferencesTest, ConcurrentWritersLoseNoUpdate) {
+  // Each thread has its own object, as separate processes would: every write
+  // must start from the file as the previous writer left it.
+  constexpr int kWriters = 4, kKeysEach = 10;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kWriters; ++t) {
+    threads.emplace_back([t] {
+      Preferences mine(kDomain);
+      for (int i = 0; i < kKeysEach; ++i) {
+        EXPECT_TRUE(
+            mine.setValue(std::to_string(t * kKeysEach + i), lmo::Value::integer(i)).has_value());
+      }
+    });
+  }
+  for (std::thread& t : threads) t.join();
+  Preferences reader(kDomain);
+  for (int k = 0; k < kWriters * kKeysEach; ++k) {
+    EXPECT_EQ(reader.valueForKey(std::to_string(k)), lmo::Value::integer(k % kKeysEach)) << k;
+  }
+}
+
+}  // namespace
+}  // namespace vantrel::platform
