@@ -1,0 +1,187 @@
+#include "omnidex/Omnidex.h"
+
+#include <utility>
+
+#include "base/Log.h"
+#include "omnidex/BundlePaths.h"
+#include "omnidex/Errors.h"
+#include "omnidex/OmnidexState.h"
+#include "omnidex/RecordFactory.h"
+#include "platform/Paths.h"
+
+namespace vantrel::omnidex {
+namespace {
+
+constexpr mode_t kStateDirectoryMode = 0755;
+constexpr const char* kContainersDirectoryName = "containers";
+
+// The configured directories as scan roots; a path that cannot be one (empty,
+// too long) is left out.
+std::vector<ScanRoot> scanRoots(const OmnidexConfig& config) {
+  std::vector<ScanRoot> roots;
+  for (const std::string& dir : config.applicationDirectories) {
+    if (std::optional<std::string> path = normalizeBundlePath(dir)) {
+      roots.push_back(ScanRoot{*path, RootKind::kApplications});
+    }
+  }
+  for (const std::string& dir : config.plugInDirectories) {
+    if (std::optional<std::string> path = normalizeBundlePath(dir)) {
+      roots.push_back(ScanRoot{*path, RootKind::kPlugIns});
+    }
+  }
+  return roots;
+}
+
+base::Error badPath(const std::string& path) {
+  return omnidexError(kOmnidexBadPath, base::format("not a usable bundle path: %@", path));
+}
+
+}  // namespace
+
+base::Result<std::shared_ptr<Omnidex>> Omnidex::open(const OmnidexConfig& config) {
+  std::optional<std::string> stateDirectory = normalizeBundlePath(config.stateDirectory);
+  if (!stateDirectory) return badPath(config.stateDirectory);
+  VT_TRY(platform::ensureDirectory(*stateDirectory, kStateDirectoryMode));
+  std::unique_ptr<Store> store = VT_TRY(Store::open(childPath(*stateDirectory, kStoreFileName)));
+  std::shared_ptr<Omnidex> omnidex(new Omnidex());
+  omnidex->state_ = std::make_unique<State>(scanRoots(config), std::move(store),
+                                            childPath(*stateDirectory, kContainersDirectoryName));
+  VT_TRY(omnidex->state_->containers.open());
+  VT_TRY(omnidex->state_->load());
+  return omnidex;
+}
+
+std::shared_ptr<Workspace> Omnidex::defaultWorkspace() {
+  // Made once and never destroyed: the registry is the process's for its
+  // whole life, and tearing it down during exit would race the threads that
+  // still use it.
+  static std::shared_ptr<Workspace>* const instance = [] {
+    base::Result<std::shared_ptr<Omnidex>> opened = open(OmnidexConfig::fromEnvironment());
+    if (!opened.has_value()) {
+      base::vtlog("unable to open the application registry: %@", opened.error());
+      return new std::shared_ptr<Workspace>();
+    }
+    return new std::shared_ptr<Workspace>(std::move(opened).value());
+  }();
+  return *instance;
+}
+
+Omnidex::~Omnidex() {
+  if (!state_) return;
+  std::unique_ptr<Watcher> watcher;
+  {
+    std::lock_guard lock(state_->monitorMutex);
+    watcher = std::move(state_->watcher);
+  }
+  watcher.reset();                // stops following; a rescan in progress finishes first
+  state_->announcements.reset();  // delivers what is queued, then joins its thread
+}
+
+void Omnidex::addObserver(std::weak_ptr<WorkspaceObserver> observer) {
+  std::lock_guard lock(state_->observersMutex);
+  state_->observers.push_back(std::move(observer));
+}
+
+void Omnidex::startMonitoring() {
+  {
+    std::lock_guard lock(state_->monitorMutex);
+    if (state_->monitoring) return;
+    state_->monitoring = true;
+  }
+  // Watches go in before the first scan, so a change made while it runs is
+  // reported afterwards rather than missed.
+  State* state = state_.get();  // outlives the watcher: ~Omnidex stops it first
+  base::Result<std::unique_ptr<Watcher>> watcher =
+      Watcher::create(state->roots, [state](const std::vector<std::string>& items, bool all) {
+        state->reconcileScope(all ? nullptr : &items);
+      });
+  if (!watcher.has_value()) {
+    base::vtlog("cannot follow the file system: %@", watcher.error().description());
+  }
+  reconcile();
+  if (watcher.has_value()) {
+    std::lock_guard lock(state_->monitorMutex);
+    state_->watcher = std::move(watcher).value();
+    state_->watcher->start();
+  }
+}
+
+void Omnidex::reconcile() {
+  state_->reconcileScope(nullptr);
+  state_->waitForAnnouncements();
+}
+
+std::optional<std::vector<PlugInRecordPtr>> Omnidex::installedPlugIns() {
+  std::shared_lock lock(state_->indexMutex);
+  return state_->indexes.all();
+}
+
+std::optional<std::vector<PlugInRecordPtr>> Omnidex::plugInsMatchingQuery(
+    const lmo::Dictionary& query, const PlugInFilter& filter) {
+  std::vector<PlugInRecordPtr> candidates;
+  {
+    std::shared_lock lock(state_->indexMutex);
+    candidates = state_->indexes.candidates(query);
+  }
+  // Filtered without the lock: the filter is the caller's code and may look
+  // things up here, or wait on something that is registering a plug-in.
+  if (!filter) return candidates;
+  static const std::string kNoIdentifier;
+  std::erase_if(candidates, [&](const PlugInRecordPtr& record) {
+    return !filter(record->identifier ? *record->identifier : kNoIdentifier, record->entitlements);
+  });
+  return candidates;
+}
+
+PlugInRecordPtr Omnidex::plugInForUuid(const base::Uuid& uuid) {
+  std::shared_lock lock(state_->indexMutex);
+  return state_->indexes.plugInWithUuid(uuid);
+}
+
+PlugInRecordPtr Omnidex::plugInForUrl(const std::string& path) {
+  std::optional<std::string> normal = normalizeBundlePath(path);
+  if (!normal) return nullptr;
+  std::shared_lock lock(state_->indexMutex);
+  const PlugInEntry* entry = state_->indexes.plugInAt(*normal);
+  return entry != nullptr ? entry->record : nullptr;
+}
+
+Workspace::ApplicationLookup Omnidex::applicationForUrl(const std::string& path) {
+  std::optional<std::string> normal = normalizeBundlePath(path);
+  if (!normal) return {};
+  std::shared_lock lock(state_->indexMutex);
+  const ApplicationEntry* entry = state_->indexes.applicationAt(*normal);
+  if (entry == nullptr) return {};
+  return ApplicationLookup{entry->record, state_->indexes.plugInsOfApplication(*normal)};
+}
+
+base::Result<void> Omnidex::registerPlugIn(const std::string& path) {
+  std::optional<std::string> normal = normalizeBundlePath(path);
+  if (!normal) return badPath(path);
+  std::lock_guard write(state_->writeMutex);
+  PlugInBundle bundle = VT_TRY(readPlugInBundle(*normal));
+  Planner planner(state_->indexes, state_->containers, currentDate());
+  VT_TRY(planner.read(std::move(bundle), Origin::kRegistration));
+  return state_->apply(planner.finish());
+}
+
+base::Result<void> Omnidex::unregisterPlugIn(const std::string& path) {
+  std::optional<std::string> normal = normalizeBundlePath(path);
+  if (!normal) return badPath(path);
+  std::lock_guard write(state_->writeMutex);
+  const PlugInEntry* entry = state_->indexes.plugInAt(*normal);
+  if (entry == nullptr) {
+    return omnidexError(kOmnidexNotRegistered,
+                        base::format("no plug-in is registered at %@", *normal));
+  }
+  Planner planner(state_->indexes, state_->containers, lmo::Date{});
+  planner.drop(*entry);
+  return state_->apply(planner.finish());
+}
+
+void Omnidex::clearCaches() {
+  std::lock_guard write(state_->writeMutex);
+  state_->store->releaseMemory();
+}
+
+}  // namespace vantrel::omnidex

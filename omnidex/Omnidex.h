@@ -1,0 +1,77 @@
+#pragma once
+// Omnidex: the application registry the daemon runs on.
+//
+// Its durable truth is one SQLite database, "registry.sqlite3" in the state
+// directory; lookups are answered from in-memory indexes (by UUID, bundle
+// path, extension point and plug-in identifier) loaded at open. The file
+// system feeds it: at startMonitoring() it reconciles the application and
+// plug-in directories with the store, then follows them with inotify so that
+// an application copied in or deleted is announced within a second.
+// Plug-ins registered explicitly by path may live anywhere and survive
+// restarts.
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "base/Result.h"
+#include "omnidex/Workspace.h"
+
+namespace vantrel::omnidex {
+
+struct OmnidexConfig {
+  std::string stateDirectory;                       // holds registry.sqlite3 and containers/
+  std::vector<std::string> applicationDirectories;  // hold *.app bundles
+  std::vector<std::string> plugInDirectories;       // hold stand-alone plug-in bundles
+
+  // VANTREL_STATE_DIR (platform::stateDirectory()), VANTREL_APP_DIRS
+  // (default "/Applications:/System/Applications") and VANTREL_PLUGIN_DIRS
+  // (default "/System/Library/PlugIns"), colon-separated.
+  static OmnidexConfig fromEnvironment();
+};
+
+class Omnidex final : public Workspace {
+ public:
+  // Opens (creating when needed) the store and loads its indexes; nothing is
+  // scanned or watched until startMonitoring(). Errors: the state directory
+  // cannot be made, the database cannot be opened, or its schema version is
+  // not the one this build reads.
+  static base::Result<std::shared_ptr<Omnidex>> open(const OmnidexConfig& config);
+
+  // The process's registry, opened from the environment on first use and
+  // kept for the life of the process; null (after a log line saying why)
+  // when it cannot be opened.
+  static std::shared_ptr<Workspace> defaultWorkspace();
+
+  // Stops watching (waiting for a rescan in progress) and delivers the
+  // announcements still queued. Must not run inside an observer callback:
+  // the announcement thread cannot wait for itself.
+  ~Omnidex() override;
+
+  // Workspace.
+  void addObserver(std::weak_ptr<WorkspaceObserver> observer) override;
+  void startMonitoring() override;
+  std::optional<std::vector<PlugInRecordPtr>> installedPlugIns() override;
+  std::optional<std::vector<PlugInRecordPtr>> plugInsMatchingQuery(
+      const lmo::Dictionary& query, const PlugInFilter& filter) override;
+  PlugInRecordPtr plugInForUuid(const base::Uuid& uuid) override;
+  PlugInRecordPtr plugInForUrl(const std::string& path) override;
+  ApplicationLookup applicationForUrl(const std::string& path) override;
+  base::Result<void> registerPlugIn(const std::string& path) override;
+  base::Result<void> unregisterPlugIn(const std::string& path) override;
+  void clearCaches() override;
+
+  // Brings the store up to date with the watched directories (and checks
+  // every plug-in registered by path) now, announcing what changed, and
+  // returns when the announcements have been delivered (called from an
+  // observer, it returns without waiting). startMonitoring() runs it once;
+  // tests and tools call it directly.
+  void reconcile();
+
+ private:
+  Omnidex() = default;
+  struct State;
+  std::unique_ptr<State> state_;
+};
+
+}  // namespace vantrel::omnidex

@@ -1,0 +1,218 @@
+#include "omnidex/OmnidexState.h"
+
+#include <set>
+#include <utility>
+
+#include "base/Log.h"
+#include "omnidex/BundlePaths.h"
+#include "omnidex/Errors.h"
+#include "omnidex/Limits.h"
+#include "omnidex/RecordFactory.h"
+
+namespace vantrel::omnidex {
+namespace {
+
+void logUnreadableRow(const std::string& path, const std::string& reason) {
+  base::vtlog("ignoring unreadable registry entry for %@: %@", path, reason);
+}
+
+// A bundle that is not there, or not a plug-in, is simply not registered; a
+// broken one is worth a line, since someone meant it to be a plug-in.
+void logRefusedBundle(const base::Error& error) {
+  if (error.code == kOmnidexNotABundle || error.code == kOmnidexNotAPlugIn) return;
+  base::vtlog("skipping bundle: %@", error.description());
+}
+
+std::optional<std::string> containerOrLog(const Containers& containers, const base::Uuid& uuid,
+                                          const std::string& path) {
+  base::Result<std::string> container = containers.ensure(uuid);
+  if (container.has_value()) return container.value();
+  base::vtlog("cannot create the data container of plug-in at %@: %@", path,
+              container.error().description());
+  return std::nullopt;
+}
+
+}  // namespace
+
+Omnidex::State::State(std::vector<ScanRoot> scanRoots, std::unique_ptr<Store> openStore,
+                      std::string containersRoot)
+    : roots(std::move(scanRoots)),
+      containers(std::move(containersRoot)),
+      store(std::move(openStore)),
+      announcements(std::make_unique<base::SerialQueue>(kAnnounceQueueLabel)) {}
+
+base::Result<void> Omnidex::State::load() {
+  std::lock_guard write(writeMutex);
+  std::unique_lock index(indexMutex);
+  return store->load(
+      [this](PlugInRow&& row) { loadPlugIn(std::move(row)); },
+      [this](ApplicationRow&& row) { loadApplication(std::move(row)); },
+      [](const std::string& path) { logUnreadableRow(path, "its UUID is not one"); });
+}
+
+void Omnidex::State::loadApplication(ApplicationRow&& row) {
+  std::optional<lmo::Dictionary> info;
+  std::optional<platform::Sha1Digest> digest;
+  if (row.infoBytes) {
+    info = parseApplicationInfo(*row.infoBytes);
+    digest = platform::sha1(row.infoBytes->data(), row.infoBytes->size());
+  }
+  indexes.putApplication(
+      ApplicationEntry{makeApplicationRecord(row.path, info), std::move(row.fingerprint), digest});
+}
+
+void Omnidex::State::loadPlugIn(PlugInRow&& row) {
+  if (indexes.size() >= kMaxRegisteredPlugIns) {
+    logUnreadableRow(row.path,
+                     base::format("the registry holds %u plug-ins already", kMaxRegisteredPlugIns));
+    return;
+  }
+  base::Result<PlugInInfo> metadata = parsePlugInInfo(row.path, row.infoBytes);
+  if (!metadata.has_value()) return logUnreadableRow(row.path, metadata.error().description());
+  base::Result<lmo::Dictionary> entitlements = parseEntitlements(row.entitlementsBytes);
+  if (!entitlements.has_value()) {
+    return logUnreadableRow(row.path, entitlements.error().description());
+  }
+  ApplicationRecordPtr app;
+  if (std::optional<std::string> appPath = containingApplicationPath(row.path)) {
+    if (const ApplicationEntry* entry = indexes.applicationAt(*appPath)) {
+      app = entry->record;
+    } else {
+      // Its row is missing (a database edited by hand): read the
+      // application now; an empty fingerprint makes the next
+      // reconciliation store it.
+      ApplicationBundle bundle = readApplicationBundle(*appPath);
+      app = makeApplicationRecord(*appPath, bundle.info);
+      indexes.putApplication(ApplicationEntry{app, {}, bundle.digest});
+    }
+  }
+  const PlugInIdentity identity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}};
+  PlugInRecordPtr record =
+      makePlugInRecord(row.path, metadata.value(), entitlements.value(), identity, app,
+                       containerOrLog(containers, row.uuid, row.path));
+  indexes.put(PlugInEntry{std::move(record), row.isExplicit, std::move(row.fingerprint),
+                          contentDigest(row.infoBytes, row.entitlementsBytes)});
+}
+
+const ScanRoot* Omnidex::State::rootOf(const std::string& item) const {
+  const size_t slash = item.rfind('/');
+  const std::string parent = slash == 0 ? "/" : item.substr(0, slash);
+  for (const ScanRoot& root : roots) {
+    if (root.path == parent) return &root;
+  }
+  return nullptr;
+}
+
+void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
+  std::lock_guard write(writeMutex);
+  Planner planner(indexes, containers, currentDate());
+  // The plug-in bundles found in the scanned scope, and the registered
+  // plug-ins in it.
+  std::set<std::string> found;
+  std::vector<const PlugInEntry*> known;
+  if (items == nullptr) {
+    for (const ScanRoot& root : roots) {
+      for (const std::string& item : itemsOf(root)) {
+        for (std::string& bundle : bundlesOfItem(root.kind, item)) found.insert(std::move(bundle));
+      }
+    }
+    for (const auto& [path, entry] : indexes.plugIns()) known.push_back(&entry);
+  } else {
+    std::set<std::string> seen;
+    for (const std::string& item : *items) {
+      const ScanRoot* root = rootOf(item);
+      if (root == nullptr) continue;
+      for (std::string& bundle : bundlesOfItem(root->kind, item)) found.insert(std::move(bundle));
+      for (const PlugInEntry* entry : indexes.plugInsWithin(item)) {
+        if (seen.insert(*entry->record->bundlePath).second) known.push_back(entry);
+      }
+    }
+  }
+  for (const PlugInEntry* entry : known) {
+    const std::string& path = *entry->record->bundlePath;
+    const bool inScan = found.erase(path) > 0;
+    // A plug-in found by a scan goes when the scan no longer finds it; one
+    // registered by path stays for as long as its bundle is readable.
+    if (!inScan && !entry->isExplicit) {
+      planner.drop(*entry);
+    } else if (plugInFingerprint(path) == entry->fingerprint) {
+      planner.keep(*entry);
+    } else if (base::Result<PlugInBundle> bundle = readPlugInBundle(path); bundle.has_value()) {
+      (void)planner.read(std::move(bundle).value(), Origin::kScan);  // cannot fail: not new
+    } else {
+      logRefusedBundle(bundle.error());
+      planner.drop(*entry);
+    }
+  }
+  for (const std::string& path : found) {
+    base::Result<PlugInBundle> bundle = readPlugInBundle(path);
+    if (!bundle.has_value()) {
+      logRefusedBundle(bundle.error());
+      continue;
+    }
+    base::Result<void> accepted = planner.read(std::move(bundle).value(), Origin::kScan);
+    if (!accepted.has_value()) logRefusedBundle(accepted.error());
+  }
+  (void)apply(planner.finish());  // a failure has been logged; the next scan tries again
+}
+
+base::Result<void> Omnidex::State::apply(ChangeSet changes) {
+  if (changes.empty()) return base::Result<void>::success();
+  base::Result<void> written = store->write(changes.batch);
+  if (!written.has_value()) {
+    for (const base::Uuid& uuid : changes.madeContainers) (void)containers.remove(uuid);
+    base::vtlog("cannot update the application registry: %@", written.error().description());
+    return written;
+  }
+  {
+    std::unique_lock index(indexMutex);
+    for (const std::string& path : changes.erasedPlugIns) indexes.erase(path);
+    for (const std::string& path : changes.erasedApplications) indexes.eraseApplication(path);
+    for (ApplicationEntry& entry : changes.putApplications)
+      indexes.putApplication(std::move(entry));
+    for (PlugInEntry& entry : changes.putPlugIns) indexes.put(std::move(entry));
+  }
+  for (const base::Uuid& uuid : changes.droppedContainers) {
+    base::Result<void> removed = containers.remove(uuid);
+    if (!removed.has_value()) {
+      base::vtlog("cannot remove the data container at %@: %@", containers.pathFor(uuid),
+                  removed.error().description());
+    }
+  }
+  announce(std::move(changes.uninstalled), std::move(changes.installed));
+  return base::Result<void>::success();
+}
+
+void Omnidex::State::announce(std::vector<PlugInRecordPtr> uninstalled,
+                              std::vector<PlugInRecordPtr> installed) {
+  if (uninstalled.empty() && installed.empty()) return;
+  // The queue is drained before State goes (~Omnidex), so `this` outlives
+  // every block.
+  announcements->async([this, uninstalled = std::move(uninstalled),
+                        installed = std::move(installed)] { deliver(uninstalled, installed); });
+}
+
+void Omnidex::State::deliver(const std::vector<PlugInRecordPtr>& uninstalled,
+                             const std::vector<PlugInRecordPtr>& installed) {
+  std::vector<std::shared_ptr<WorkspaceObserver>> live;
+  {
+    std::lock_guard lock(observersMutex);
+    std::erase_if(observers, [](const std::weak_ptr<WorkspaceObserver>& o) { return o.expired(); });
+    for (const std::weak_ptr<WorkspaceObserver>& weak : observers) {
+      if (std::shared_ptr<WorkspaceObserver> observer = weak.lock()) live.push_back(observer);
+    }
+  }
+  if (!uninstalled.empty()) {
+    for (const auto& observer : live) observer->pluginsWillUninstall(uninstalled);
+  }
+  if (!installed.empty()) {
+    for (const auto& observer : live) observer->pluginsDidInstall(installed);
+  }
+}
+
+void Omnidex::State::waitForAnnouncements() {
+  if (announcements->isCurrent()) return;
+  announcements->sync([] {});
+}
+
+}  // namespace vantrel::omnidex

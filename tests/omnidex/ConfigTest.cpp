@@ -1,0 +1,68 @@
+#include <stdlib.h>
+
+#include <filesystem>
+
+#include "tests/omnidex/OmnidexFixtures.h"
+
+namespace vantrel::omnidex {
+namespace {
+
+using testing::plugInInfo;
+using testing::writeBundle;
+
+// Sets or (value null) unsets a variable for the life of the object.
+class ScopedEnvironment {
+ public:
+  ScopedEnvironment(const char* name, const char* value) : name_(name) {
+    if (const char* old = ::getenv(name)) old_ = old;
+    value ? ::setenv(name, value, 1) : ::unsetenv(name);
+  }
+  ~ScopedEnvironment() { old_ ? ::setenv(name_, old_->c_str(), 1) : ::unsetenv(name_); }
+
+ private:
+  const char* name_;
+  std::optional<std::string> old_;
+};
+
+TEST(OmnidexConfig, DirectoryListsComeFromTheEnvironment) {
+  const std::vector<std::string> defaultApps{"/Applications", "/System/Applications"};
+  const std::vector<std::string> defaultPlugIns{"/System/Library/PlugIns"};
+  const struct {
+    const char* apps;  // null: unset
+    const char* plugIns;
+    std::vector<std::string> expectedApps;
+    std::vector<std::string> expectedPlugIns;
+  } cases[] = {
+      {nullptr, nullptr, defaultApps, defaultPlugIns},
+      {"/a::/b:", "/p", {"/a", "/b"}, {"/p"}},
+      {"", ":", {}, {}},
+  };
+  for (const auto& c : cases) {
+    ScopedEnvironment apps("VANTREL_APP_DIRS", c.apps);
+    ScopedEnvironment plugIns("VANTREL_PLUGIN_DIRS", c.plugIns);
+    ScopedEnvironment state("VANTREL_STATE_DIR", "/somewhere/state");
+    const OmnidexConfig config = OmnidexConfig::fromEnvironment();
+    EXPECT_EQ(config.stateDirectory, "/somewhere/state");
+    EXPECT_EQ(config.applicationDirectories, c.expectedApps);
+    EXPECT_EQ(config.plugInDirectories, c.expectedPlugIns);
+  }
+}
+
+TEST(OmnidexConfig, DefaultWorkspaceIsOpenedOnceFromTheEnvironment) {
+  // The process's registry outlives the test, and so must its directory.
+  static vantrel::testing::TempDir temp;
+  ScopedEnvironment state("VANTREL_STATE_DIR", temp.file("state").c_str());
+  ScopedEnvironment apps("VANTREL_APP_DIRS", temp.file("apps").c_str());
+  ScopedEnvironment plugIns("VANTREL_PLUGIN_DIRS", "");
+  std::shared_ptr<Workspace> workspace = Omnidex::defaultWorkspace();
+  ASSERT_NE(workspace, nullptr);
+  EXPECT_EQ(Omnidex::defaultWorkspace(), workspace);
+  EXPECT_TRUE(std::filesystem::exists(temp.file("state/registry.sqlite3")));
+  const std::string app = temp.file("apps/A.app");
+  writeBundle(app + "/PlugIns/P.appex", plugInInfo("a.p", "p"));
+  static_cast<Omnidex&>(*workspace).reconcile();
+  EXPECT_NE(workspace->plugInForUrl(app + "/PlugIns/P.appex"), nullptr);
+}
+
+}  // namespace
+}  // namespace vantrel::omnidex
