@@ -1,12 +1,8 @@
 #include "omnidex/BundleReader.h"
 
-#include <fcntl.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
-#include <cstring>
 #include <tuple>
 #include <utility>
 
@@ -15,6 +11,8 @@
 #include "omnidex/Errors.h"
 #include "omnidex/Limits.h"
 #include "platform/PropertyList.h"
+#include "platform/SmallFile.h"
+#include "platform/TrustedFile.h"
 
 namespace vantrel::omnidex {
 namespace {
@@ -25,20 +23,6 @@ constexpr const char* kExtensionIdentifierKey = "QXExtensionIdentifier";
 constexpr const char* kBundleIdentifierKey = "KBBundleIdentifier";
 // What a fingerprint says about a file that is not there.
 constexpr const char* kNoFile = "-";
-
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd_(fd) {}
-  ~FileDescriptor() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 std::string stamp(const struct stat& st) {
   std::string s;
@@ -69,99 +53,24 @@ std::string fileStamp(const std::string& path) {
   return stamp(st);
 }
 
-// The outcome of opening and reading one small file.
-struct FileRead {
-  int error = 0;  // errno of the open, or 0
-  bool symbolicLink = false;
-  bool notRegular = false;
-  bool tooLarge = false;
-  struct stat st {};
-  std::string bytes;
-};
-
-// Reads the regular file at path, at most maxBytes, without following a
-// symbolic link at path and without blocking on a FIFO.
-FileRead readSmallFile(const std::string& path, size_t maxBytes) {
-  FileRead r;
-  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
-  if (fd.get() < 0) {
-    r.error = errno;
-    r.symbolicLink = (errno == ELOOP);
-    return r;
-  }
-  if (::fstat(fd.get(), &r.st) != 0) {
-    r.error = errno;
-    return r;
-  }
-  if (!S_ISREG(r.st.st_mode)) {
-    r.notRegular = true;
-    return r;
-  }
-  if (static_cast<uint64_t>(r.st.st_size) > maxBytes) {
-    r.tooLarge = true;
-    return r;
-  }
-  // The file may grow while it is read: read one byte beyond the bound to
-  // notice.
-  r.bytes.resize(static_cast<size_t>(r.st.st_size) + 1);
-  size_t used = 0;
-  while (used < r.bytes.size()) {
-    const ssize_t n = ::read(fd.get(), r.bytes.data() + used, r.bytes.size() - used);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      r.error = errno;
-      r.bytes.clear();
-      return r;
-    }
-    if (n == 0) break;
-    used += static_cast<size_t>(n);
-    if (used == r.bytes.size() && used <= maxBytes)
-      r.bytes.resize(std::min(used * 2, maxBytes + 1));
-  }
-  if (used > maxBytes) {
-    r.tooLarge = true;
-    r.bytes.clear();
-    return r;
-  }
-  r.bytes.resize(used);
-  return r;
-}
-
-// Why an Info.plist read failed, or nullopt when it did not.
-std::optional<std::string> readProblem(const FileRead& r, size_t maxBytes) {
-  if (r.symbolicLink) return std::string("it is a symbolic link");
-  if (r.notRegular) return std::string("it is not a regular file");
-  if (r.tooLarge) return base::format("it is larger than %u bytes", maxBytes);
-  if (r.error != 0) return std::string(std::strerror(r.error));
-  return std::nullopt;
-}
-
-std::string entitlementsProblem(const FileRead& r) {
-  if (std::optional<std::string> problem = readProblem(r, kMaxEntitlementsBytes)) {
-    return *problem;
-  }
-  if (r.st.st_uid != 0 && r.st.st_uid != ::geteuid()) {
-    return base::format("it is owned by uid %u", static_cast<unsigned>(r.st.st_uid));
-  }
-  if ((r.st.st_mode & (S_IWGRP | S_IWOTH)) != 0) return "it is writable by group or others";
-  return {};
-}
-
 // The entitlements of the plug-in at bundlePath when Entitlements.plist can
 // be trusted: a file anyone else could have written stands in for no
 // signature at all. The bytes are returned with the dictionary so that the
 // store keeps exactly what was trusted.
 std::pair<lmo::Dictionary, std::string> readTrustedEntitlements(const std::string& bundlePath) {
-  const FileRead r =
-      readSmallFile(childPath(bundlePath, kEntitlementsPlistName), kMaxEntitlementsBytes);
-  if (r.error == ENOENT) return {};
-  std::string problem = entitlementsProblem(r);
-  if (problem.empty()) {
-    base::Result<lmo::Value> value = platform::readPropertyList(r.bytes);
+  base::Result<std::optional<std::string>> bytes = platform::readTrustedFile(
+      childPath(bundlePath, kEntitlementsPlistName), kMaxEntitlementsBytes);
+  std::string problem;
+  if (!bytes.has_value()) {
+    problem = bytes.error().description();
+  } else if (!bytes.value()) {
+    return {};
+  } else {
+    base::Result<lmo::Value> value = platform::readPropertyList(*bytes.value());
     if (!value.has_value()) {
       problem = value.error().description();
     } else if (const lmo::Dictionary* dict = value->getIfDictionary()) {
-      return {*dict, r.bytes};
+      return {*dict, std::move(*bytes.value())};
     } else {
       problem = "it is not a dictionary";
     }
@@ -240,12 +149,13 @@ base::Result<PlugInBundle> readPlugInBundle(const std::string& path) {
   // The entitlements' stamp comes first: it is taken before either file is
   // read.
   const std::string entitlementsStamp = fileStamp(childPath(path, kEntitlementsPlistName));
-  const FileRead info = readSmallFile(childPath(path, kInfoPlistName), kMaxInfoPlistBytes);
+  platform::SmallFileRead info =
+      platform::readSmallFile(childPath(path, kInfoPlistName), kMaxInfoPlistBytes);
   if (info.error == ENOENT) {
     return omnidexError(kOmnidexNotABundle,
                         base::format("no Info.plist in the bundle at %@", path));
   }
-  if (std::optional<std::string> problem = readProblem(info, kMaxInfoPlistBytes)) {
+  if (std::optional<std::string> problem = platform::smallFileProblem(info, kMaxInfoPlistBytes)) {
     return omnidexError(
         kOmnidexMalformedBundle,
         base::format("cannot read the Info.plist of the bundle at %@: %@", path, *problem));
@@ -268,8 +178,8 @@ ApplicationBundle readApplicationBundle(const std::string& path) {
   app.path = path;
   const std::string infoPath = childPath(path, kInfoPlistName);
   app.fingerprint = fileStamp(infoPath);
-  FileRead r = readSmallFile(infoPath, kMaxInfoPlistBytes);
-  if (readProblem(r, kMaxInfoPlistBytes)) return app;
+  platform::SmallFileRead r = platform::readSmallFile(infoPath, kMaxInfoPlistBytes);
+  if (platform::smallFileProblem(r, kMaxInfoPlistBytes)) return app;
   app.info = parseApplicationInfo(r.bytes);
   if (app.info) {
     app.digest = platform::sha1(r.bytes.data(), r.bytes.size());
