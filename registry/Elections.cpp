@@ -1,0 +1,42 @@
+// The database's annotation operations: every annotation read and write of
+// the request operations runs on the database queue, and every change made
+// through setAnnotation is broadcast.
+
+#include "base/Log.h"
+#include "model/Collections.h"
+#include "platform/NotificationCenter.h"
+#include "registry/VTDatabase.h"
+
+namespace vantrel::registry {
+
+std::optional<lmo::Dictionary> VTDatabase::annotationForPlugIn(const VTDPlugIn& plugIn) {
+  std::optional<lmo::Dictionary> annotation;
+  sync_.sync([&] { annotation = annotations_->annotationForPlugIn(plugIn); });
+  return annotation;
+}
+
+std::optional<base::Error> VTDatabase::setAnnotation(
+    const std::optional<lmo::Dictionary>& annotation, const VTDPlugIn& plugIn) {
+  sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn); });
+  // Posted off the queue: watchers that react by asking the daemon must not
+  // find the queue still held. The notification carries nothing, so a post
+  // that fails costs watchers one refresh; it is logged and not reported.
+  base::Result<uint64_t> posted = platform::postNotification(kAnnotationChangeNotification);
+  if (!posted.has_value()) {
+    base::vtlog("unable to post notification %@: %@", kAnnotationChangeNotification,
+                posted.error());
+  }
+  return std::nullopt;
+}
+
+void VTDatabase::autoElect(const VTDPlugIn& plugIn) {
+  sync_.assertCurrent();
+  const lmo::Dictionary annotation =
+      annotations_->annotationForPlugIn(plugIn).value_or(lmo::Dictionary());
+  const lmo::Value& election = annotation.get(kElectionKey);
+  if (!election.isNull() && election.integerValue() != 0) return;
+  annotations_->setAnnotation(
+      model::dictionaryChanging(annotation, kElectionKey, lmo::Value::integer(1)), plugIn);
+}
+
+}  // namespace vantrel::registry

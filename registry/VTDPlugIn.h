@@ -1,0 +1,115 @@
+#pragma once
+// The daemon's plug-in record: a VTPlugInCore built from the application
+// registry's record of an installed plug-in. It keeps that registry record
+// for its whole life and answers every metadata lookup through it, so nothing
+// of the bundle's Info dictionary is copied at construction and every reader
+// sees the registry's current snapshot of the plug-in.
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "lmo/Value.h"
+#include "model/VTPlugInCore.h"
+#include "omnidex/Records.h"
+
+namespace vantrel::registry {
+
+// An entitlement whose string value names the plug-in this one replaces: the
+// two share one annotation (and so one election).
+inline constexpr std::string_view kReplacePlugInEntitlement = "com.karvo.developer.replace-plugin";
+// An entitlement that has the plug-in elected automatically when its record
+// is built.
+inline constexpr std::string_view kAutoElectEntitlement = "com.karvo.developer.auto-elect-plugin";
+// Extension dictionary key that sets the hub protocol version.
+inline constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
+
+class VTDPlugIn : public model::VTPlugInCore {
+ public:
+  // Hub protocol versions of plug-ins that do not declare one.
+  static constexpr uint32_t kOldStyleHubProtocolVersion = 1;
+  static constexpr uint32_t kDefaultHubProtocolVersion = 2;
+
+  // Builds the record of one registry record. Null when the registry record
+  // has no bundle path (silently), when it has no identifier (the base logs
+  // "missing identifier in plug-in at %@"), or when the plug-in is
+  // mis-configured: then "ignoring mis-configured plug-in at %@: %@" is logged
+  // with the bundle path and the reason. Runs on the database queue; the
+  // record is complete before anyone else sees it.
+  static std::shared_ptr<VTDPlugIn> initWithOXData(omnidex::PlugInRecordPtr record);
+
+  // ---- Metadata, through the registry record ----
+  // A record that has no registry record (one made from a form) answers from
+  // its own fields, as the base does.
+
+  // The registry record's keyed lookup: the Info dictionary (falling back to
+  // the extension dictionary for a key absent there), the extension
+  // dictionary, and the attributes dictionary.
+  lmo::Value infoKey(std::string_view key) const override;
+  lmo::Value pluginKey(std::string_view key) const override;
+  lmo::Value attribute(std::string_view key) const override;
+  // The registry record's Info dictionary, not the stored field (which stays
+  // empty for records built from registry data).
+  std::optional<lmo::Dictionary> bundleInfoDictionary() const override;
+
+  // The base's rules, then: a plug-in that is not data-only needs a data
+  // container, and a plug-in outside an application must lie under
+  // "/System/". Code 12, as the base.
+  std::optional<base::Error> diagnose() const override;
+
+  // ---- Display names ----
+  // Each is fetched from the registry record on its first read and kept; a
+  // value set before the first read wins, and setting null makes the next
+  // read fetch again. Safe to call from any thread.
+
+  std::optional<std::string> localizedName() const override;
+  void setLocalizedName(std::optional<std::string> name) override;
+  std::optional<std::string> localizedShortName() const override;
+  void setLocalizedShortName(std::optional<std::string> name) override;
+  // The containing application's name; null for a stand-alone plug-in.
+  std::optional<std::string> localizedContainingName() const override;
+  void setLocalizedContainingName(std::optional<std::string> name) override;
+
+  // ---- Entitlements and annotations ----
+
+  // The entitlement's value, or null.
+  lmo::Value valueForEntitlement(std::string_view name) const;
+  // The entitlement exists and is not false (a number 0 counts as false;
+  // strings, containers and other numbers count as granted).
+  bool hasEntitlement(std::string_view name) const;
+  // Where the annotation store keeps this plug-in's annotation: the string
+  // value of the replace-plugin entitlement, else the identifier. Null only
+  // for a record that has neither.
+  std::optional<std::string> annotationKey() const;
+
+  // Every entry of info whose key does not begin with "DT" (case-sensitive);
+  // empty for null.
+  static lmo::Dictionary prunedInfoDictionaryFor(const std::optional<lmo::Dictionary>& info);
+
+  // The registry record. Set once, by initWithOXData, before the record is
+  // shared; setOxproxy is not safe against concurrent readers.
+  const omnidex::PlugInRecordPtr& oxproxy() const { return oxproxy_; }
+  void setOxproxy(omnidex::PlugInRecordPtr record) { oxproxy_ = std::move(record); }
+
+ private:
+  using NameFetch = std::optional<std::string> (*)(const omnidex::PlugInRecord&);
+  // The stored name in field, or (when none is stored) the registry's,
+  // which is stored unless a setter got there first.
+  std::optional<std::string> lazyName(std::optional<std::string>& field, NameFetch fetch) const;
+
+  omnidex::PlugInRecordPtr oxproxy_;  // Constant once the record is shared.
+
+  // Guards the three names below: a first read stores what it fetched while
+  // other threads may read or set the same field.
+  mutable std::mutex namesMutex_;
+  mutable std::optional<std::string> localizedName_;
+  mutable std::optional<std::string> localizedShortName_;
+  mutable std::optional<std::string> localizedContainingName_;
+};
+
+using VTDPlugInPtr = std::shared_ptr<VTDPlugIn>;
+
+}  // namespace vantrel::registry

@@ -1,0 +1,123 @@
+#pragma once
+// A scripted application registry, and an environment that keeps each
+// registry test's notifications, state and annotations in a fresh directory.
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cstdlib>
+#include <map>
+#include <set>
+
+#include "omnidex/Workspace.h"
+#include "registry/VTDatabase.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::registry::testing {
+
+using omnidex::PlugInRecordPtr;
+using Names = std::multiset<std::string>;
+
+// A valid stand-alone plug-in under /System/ with a data container.
+inline std::shared_ptr<omnidex::PlugInRecord> record(const std::string& identifier,
+                                                     lmo::Dictionary entitlements = {}) {
+  auto r = std::make_shared<omnidex::PlugInRecord>();
+  r->uuid = base::Uuid::random();
+  r->bundlePath = "/System/Library/PlugIns/" + identifier + ".plugin";
+  r->identifier = r->originalIdentifier = r->bundleIdentifier = identifier;
+  r->bundleVersion = "3";
+  r->extensionDictionary = {{"QXExtensionProtocol", "P"},
+                            {"QXExtensionPointIdentifier", "com.karvo.point"},
+                            {"QXExtensionAttributes", lmo::Dictionary{}}};
+  r->infoDictionary = {{"QXExtension", r->extensionDictionary}, {"KBBundleIdentifier", identifier}};
+  r->entitlements = std::move(entitlements);
+  r->dataContainerPath = "/var/lib/vantrel/containers/x";
+  return r;
+}
+
+inline lmo::Dictionary election(int64_t e) {
+  return {{"election", lmo::Value::integer(e)}};
+}
+
+// The identifiers of a lookup's records, duplicates kept.
+inline std::optional<Names> identifiers(const std::optional<VTDatabase::PlugInList>& found) {
+  if (!found) return std::nullopt;
+  Names names;
+  for (const VTDPlugInPtr& p : *found) names.insert(*p->identifier());
+  return names;
+}
+
+// Counts the records it is told were removed.
+struct CountingDelegate : VTDatabaseDelegate {
+  void removedPlugIns(const std::vector<PlugInRecordPtr>& records) override {
+    removed += static_cast<int>(records.size());
+  }
+  std::atomic<int> removed{0};
+};
+
+// Serves the records it is given. Its fields are set before the database
+// uses it, then only read. Tests announce by calling the database.
+class FakeWorkspace : public omnidex::Workspace {
+ public:
+  std::vector<PlugInRecordPtr> records;
+  bool failing = false;
+  int cacheClears = 0;  // changed on the database queue only
+
+  void addObserver(std::weak_ptr<omnidex::WorkspaceObserver>) override {}
+  void startMonitoring() override {}
+  std::optional<std::vector<PlugInRecordPtr>> installedPlugIns() override {
+    return failing ? std::nullopt : std::optional(records);
+  }
+  std::optional<std::vector<PlugInRecordPtr>> plugInsMatchingQuery(
+      const lmo::Dictionary&, const omnidex::PlugInFilter& filter) override {
+    auto all = installedPlugIns();
+    if (all) std::erase_if(*all, [&](auto& r) { return !filter(*r->identifier, r->entitlements); });
+    return all;
+  }
+  PlugInRecordPtr plugInForUuid(const base::Uuid& uuid) override {
+    return first([&](const PlugInRecordPtr& r) { return r->uuid == uuid; });
+  }
+  PlugInRecordPtr plugInForUrl(const std::string& path) override {
+    return first([&](const PlugInRecordPtr& r) { return r->bundlePath == path; });
+  }
+  ApplicationLookup applicationForUrl(const std::string&) override { return {}; }
+  base::Result<void> registerPlugIn(const std::string&) override { return ok(); }
+  base::Result<void> unregisterPlugIn(const std::string&) override { return ok(); }
+  void clearCaches() override { ++cacheClears; }
+
+ private:
+  static base::Result<void> ok() { return base::Result<void>::success(); }
+  template <typename Predicate>
+  PlugInRecordPtr first(Predicate matches) const {
+    auto found = std::find_if(records.begin(), records.end(), matches);
+    return found == records.end() ? nullptr : *found;
+  }
+};
+
+// Points the runtime, state and annotation directories into a temporary
+// directory, and restores the environment afterwards.
+class RegistryTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    for (const char* name : {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME", "HOME"})
+      saved_[name] =
+          std::getenv(name) ? std::optional<std::string>(std::getenv(name)) : std::nullopt;
+    ::setenv("VANTREL_RUNTIME_DIR", tmp_.file("run").c_str(), 1);
+    ::setenv("VANTREL_STATE_DIR", tmp_.file("state").c_str(), 1);
+    ::setenv("XDG_STATE_HOME", tmp_.file("xdg").c_str(), 1);
+  }
+  void TearDown() override {
+    for (const auto& [name, value] : saved_)
+      value ? ::setenv(name.c_str(), value->c_str(), 1) : ::unsetenv(name.c_str());
+  }
+  VTDatabasePtr database() {
+    return VTDatabase::initWithDatabase(tmp_.file("Annotations"), workspace_);
+  }
+
+  vantrel::testing::TempDir tmp_;
+  std::shared_ptr<FakeWorkspace> workspace_ = std::make_shared<FakeWorkspace>();
+  std::map<std::string, std::optional<std::string>> saved_;
+};
+
+}  // namespace vantrel::registry::testing
