@@ -67,10 +67,11 @@ SerialQueue::~SerialQueue() {
 }
 
 void SerialQueue::async(Block block) {
-  {
-    std::lock_guard lock(mutex_);
-    tasks_.push_back(Task{std::move(block), {}, nullptr});
-  }
+  // Notified under the mutex: once it is released, the block may run and
+  // its effects may let another thread destroy this queue, condition
+  // variable included, before a notify made afterwards would happen.
+  std::lock_guard lock(mutex_);
+  tasks_.push_back(Task{std::move(block), {}, nullptr});
   wake_.notify_one();
 }
 
@@ -89,9 +90,7 @@ void SerialQueue::sync(const Block& block) {
     runBlock(inlineTask);
     lock.lock();
     running_ = false;
-    bool more = !tasks_.empty();
-    lock.unlock();
-    if (more) wake_.notify_one();
+    if (!tasks_.empty()) wake_.notify_one();
     return;
   }
   auto waiter = std::make_shared<SyncWaiter>();

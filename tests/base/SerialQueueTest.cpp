@@ -5,6 +5,7 @@
 #include <atomic>
 #include <chrono>
 #include <latch>
+#include <memory>
 #include <thread>
 #include <vector>
 
@@ -96,6 +97,21 @@ TEST(SerialQueue, SyncWaitsForABusyQueue) {
   q.sync([&] { sawFirstDone = firstDone; });
   releaser.join();
   EXPECT_TRUE(sawFirstDone);
+}
+
+// A block posted from another thread may be what lets the owner destroy the
+// queue; the posting thread must be done with the queue by then. (A notify
+// made after releasing the queue's lock raced the destructor; ThreadSanitizer
+// reports it.)
+TEST(SerialQueue, OwnerMayDestroyTheQueueOnceAPostedBlockRan) {
+  for (int i = 0; i < 200; ++i) {
+    auto queue = std::make_unique<SerialQueue>("reply");
+    std::latch ran(1);
+    std::thread poster([&] { queue->async([&] { ran.count_down(); }); });
+    ran.wait();
+    queue.reset();
+    poster.join();
+  }
 }
 
 TEST(SerialQueueDeathTest, DeadlocksAreCaughtInsteadOfHanging) {
