@@ -1,0 +1,412 @@
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "base/Log.h"
+#include "lmo/Connection.h"
+#include "lmo/Listener.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::lmo {
+namespace {
+
+using namespace std::chrono_literals;
+using Bytes = std::vector<uint8_t>;
+
+// Collects events from other threads; waits with a deadline, never a sleep.
+class Recorder {
+ public:
+  void add(std::string what) {
+    std::lock_guard lock(mutex_);
+    events_.push_back(std::move(what));
+    changed_.notify_all();
+  }
+  bool waitFor(size_t count) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, 10s, [&] { return events_.size() >= count; });
+  }
+  std::vector<std::string> events() const {
+    std::lock_guard lock(mutex_);
+    return events_;
+  }
+  size_t count(const std::string& what) const {
+    std::lock_guard lock(mutex_);
+    return static_cast<size_t>(std::count(events_.begin(), events_.end(), what));
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<std::string> events_;
+};
+
+std::string eventText(const Event& e) {
+  if (e.isError()) return describe(*e.error());
+  return describe(e.message()->body());
+}
+
+QueuePtr makeQueue(const char* label) {
+  return std::make_shared<base::SerialQueue>(label);
+}
+
+// A listener whose connections answer each request with {"echo": body},
+// answer {"flood": 1} with 16 MiB of messages first, and end the connection on
+// {"die": 1}. Handlers hold the shared state, never the server object, so a
+// late event after a test has ended touches nothing that is gone.
+class EchoServer {
+ public:
+  struct State {
+    Recorder events;
+    std::atomic<size_t> outputLimit{0};
+    std::mutex mutex;
+    std::vector<std::shared_ptr<Connection>> accepted;  // Guarded by mutex.
+  };
+
+  explicit EchoServer(const std::string& path) : queue_(makeQueue("lmo-test")) {
+    auto listener = Listener::create(path, queue_);
+    EXPECT_TRUE(listener.has_value()) << listener.error().description();
+    listener_ = listener.value();
+    listener_->setConnectionHandler([state = state_](std::shared_ptr<Connection> c) {
+      {
+        std::lock_guard lock(state->mutex);
+        state->accepted.push_back(c);
+      }
+      std::weak_ptr<Connection> weak = c;
+      c->setEventHandler([state, weak](const Event& e) {
+        state->events.add(eventText(e));
+        auto connection = weak.lock();
+        const IncomingMessage* m = e.message();
+        if (connection == nullptr || m == nullptr) return;
+        if (m->body().contains("die")) {
+          connection->cancel();
+          return;
+        }
+        if (m->body().contains("flood")) {
+          for (int i = 0; i < 256; ++i) {
+            (void)connection->send(Dictionary{{"bulk", Value::data(Bytes(64 * 1024, 1))}});
+          }
+        }
+        if (auto reply = createReply(*m)) {
+          reply->body = reply->body.setting("echo", Value(m->body()));
+          (void)connection->sendReply(*reply);
+        }
+      });
+      if (size_t limit = state->outputLimit.load(); limit != 0) c->setOutputLimitForTest(limit);
+      c->resume();
+    });
+    listener_->resume();
+  }
+  ~EchoServer() {
+    listener_->cancel();
+    std::lock_guard lock(state_->mutex);
+    for (auto& c : state_->accepted) c->cancel();
+  }
+  std::vector<std::shared_ptr<Connection>> accepted() const {
+    std::lock_guard lock(state_->mutex);
+    return state_->accepted;
+  }
+  void setOutputLimit(size_t bytes) { state_->outputLimit = bytes; }
+
+ private:
+  std::shared_ptr<State> state_ = std::make_shared<State>();
+
+ public:
+  Recorder& serverEvents = state_->events;
+
+ private:
+  QueuePtr queue_;
+  std::shared_ptr<Listener> listener_;
+};
+
+using RecorderPtr = std::shared_ptr<Recorder>;
+RecorderPtr recorder() {
+  return std::make_shared<Recorder>();
+}
+
+// Handlers capture recorders by shared pointer: a connection may deliver its
+// last event after the test that made it has returned.
+std::shared_ptr<Connection> connectRecorded(const std::string& path, const RecorderPtr& recorder) {
+  auto c = Connection::connectToService(path, makeQueue("client"));
+  c->setEventHandler([recorder](const Event& e) { recorder->add(eventText(e)); });
+  c->resume();
+  return c;
+}
+
+// A plain socket connected to path, for writing raw bytes.
+int rawConnect(const std::string& path) {
+  int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::memcpy(addr.sun_path, path.data(), path.size());
+  EXPECT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  return fd;
+}
+
+Bytes frameOf(FrameKind kind, uint64_t id, const Dictionary& body) {
+  return encodeFrame({kind, id, 0, body}).value();
+}
+
+TEST(ConnectionTest, RepliesReachTheirOwnHandlersOnce) {
+  testing::TempDir dir;
+  std::string path = dir.file("svc");
+  EchoServer server(path);
+  struct stat st {};
+  ASSERT_EQ(::stat(path.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0666u);
+
+  auto eventsA = recorder(), eventsB = recorder(), replies = recorder();
+  auto a = connectRecorded(path, eventsA);
+  auto b = connectRecorded(path, eventsB);
+  auto replyQueue = makeQueue("replies");
+  for (int i = 0; i < 3; ++i) {
+    for (auto* c : {&a, &b}) {
+      std::string tag = (c == &a ? "a" : "b") + std::to_string(i);
+      ASSERT_TRUE((*c)->sendWithReply(Dictionary{{"tag", Value(tag)}}, replyQueue,
+                                      [replies, tag](const Event& e) {
+                                        const IncomingMessage* m = e.message();
+                                        const Value& echo = m ? m->body().get("echo") : Value();
+                                        const Dictionary* d = echo.getIfDictionary();
+                                        replies->add(tag + "=" +
+                                                     (d ? describe(d->get("tag")) : "?"));
+                                      })
+                      .has_value());
+    }
+  }
+  ASSERT_TRUE(a->send(Dictionary{{"note", Value("no reply")}}).has_value());
+  ASSERT_TRUE(replies->waitFor(6));
+  ASSERT_TRUE(server.serverEvents.waitFor(7));
+  a->cancel();
+  b->cancel();
+  ASSERT_TRUE(eventsA->waitFor(1));
+  ASSERT_TRUE(eventsB->waitFor(1));
+  ASSERT_TRUE(server.serverEvents.waitFor(9));
+  for (int i = 0; i < 3; ++i) {
+    for (const char* c : {"a", "b"}) {
+      std::string tag = c + std::to_string(i);
+      EXPECT_EQ(replies->count(tag + "=" + tag), 1u) << tag;
+    }
+  }
+  EXPECT_EQ(replies->events().size(), 6u);
+  EXPECT_EQ(eventsA->events(), std::vector<std::string>{"connection invalid"});
+  EXPECT_EQ(server.serverEvents.count("connection invalid"), 2u);
+
+  // Both ends see the other's kernel credentials; here that is this process.
+  for (const auto& c : server.accepted()) {
+    EXPECT_EQ(c->pid(), ::getpid());
+    EXPECT_EQ(c->uid(), ::geteuid());
+    EXPECT_EQ(c->gid(), ::getegid());
+    EXPECT_GE(c->pidfd(), 0);
+  }
+  EXPECT_EQ(a->pid(), ::getpid());
+  if (::geteuid() == 0) {
+    EXPECT_EQ(a->uid(), 0u);
+  }
+}
+
+TEST(ConnectionTest, ConnectionEndFailsPendingRepliesAndRunsTheFinalizer) {
+  testing::TempDir dir;
+  std::string path = dir.file("svc");
+  EchoServer server(path);
+  auto events = recorder(), replies = recorder(), finalized = recorder();
+  auto context = std::make_shared<int>(7);
+  std::weak_ptr<int> weakContext = context;
+  auto c = Connection::connectToService(path, makeQueue("client"));
+  c->setEventHandler([events](const Event& e) { events->add(eventText(e)); });
+  c->setContext(context);
+  c->setFinalizer([finalized, events] {
+    finalized->add("finalized after " + std::to_string(events->events().size()) + " events");
+  });
+  context.reset();
+  c->resume();
+  auto replyQueue = makeQueue("replies");
+  for (int i = 0; i < 3; ++i) {
+    // The server never answers these: it ends the connection on the first.
+    ASSERT_TRUE(c->sendWithReply(Dictionary{{"die", Value::integer(1)}}, replyQueue,
+                                 [replies](const Event& e) { replies->add(eventText(e)); })
+                    .has_value());
+  }
+  ASSERT_TRUE(replies->waitFor(3));
+  ASSERT_TRUE(finalized->waitFor(1));
+  EXPECT_EQ(replies->count("connection invalid"), 3u);
+  EXPECT_EQ(events->events(), std::vector<std::string>{"connection invalid"});
+  EXPECT_EQ(finalized->events(), std::vector<std::string>{"finalized after 1 events"});
+  EXPECT_TRUE(weakContext.expired() || (finalized->waitFor(1) && weakContext.expired()));
+
+  // After the end, a request fails at once instead of waiting for ever.
+  ASSERT_TRUE(c->sendWithReply(Dictionary{}, replyQueue, [replies](const Event& e) {
+                 replies->add(eventText(e));
+               }).has_value());
+  ASSERT_TRUE(replies->waitFor(4));
+  EXPECT_EQ(replies->count("connection invalid"), 4u);
+
+  // A service nobody listens on behaves the same.
+  auto missingEvents = recorder();
+  auto missing = connectRecorded(dir.file("nobody"), missingEvents);
+  ASSERT_TRUE(missingEvents->waitFor(1));
+  EXPECT_EQ(missingEvents->events(), std::vector<std::string>{"connection invalid"});
+}
+
+TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
+  testing::TempDir dir;
+  std::string path = dir.file("svc");
+  EchoServer server(path);
+  auto events = recorder(), replies = recorder();
+  auto good = connectRecorded(path, events);
+  auto replyQueue = makeQueue("replies");
+
+  Bytes oversized = {0x01, 0x00, 0x00, 0x01};  // 16 MiB + 1, refused from the length alone
+  Bytes badVersion = frameOf(FrameKind::kMessage, 1, Dictionary{});
+  badVersion[4] = 9;
+  Bytes badKind = frameOf(FrameKind::kMessage, 1, Dictionary{});
+  badKind[5] = 7;
+  Bytes notMap = {0, 0, 0, 21, 1, 2, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 0, 0x01};
+  Bytes truncated = frameOf(FrameKind::kMessage, 1, Dictionary{{"k", Value("v")}});
+  truncated.pop_back();
+  Bytes strayReply = encodeFrame({FrameKind::kReply, 1, 99, Dictionary{}}).value();
+  struct Case {
+    const char* name;
+    Bytes bytes;
+    const char* reason;
+  };
+  const Case cases[] = {
+      {"too long", oversized, "exceeds the limit"},
+      {"unknown version", badVersion, "unknown frame version 9"},
+      {"unknown kind", badKind, "unknown frame kind 7"},
+      {"not a map", notMap, "not a map"},
+      {"truncated", truncated, "truncated frame"},
+      {"reply to nothing", strayReply, "reply to unknown message 99"},
+  };
+  size_t invalidations = 0;
+  size_t serverEvents = 0;  // the bad peers' invalidations and the good client's requests
+  for (const Case& c : cases) {
+    base::LogCapture log;
+    int fd = rawConnect(path);
+    ASSERT_EQ(::send(fd, c.bytes.data(), c.bytes.size(), MSG_NOSIGNAL),
+              static_cast<ssize_t>(c.bytes.size()));
+    if (std::string(c.name) == "truncated") ::shutdown(fd, SHUT_WR);
+    // The daemon closes the socket: the raw peer reads end of file.
+    char byte;
+    EXPECT_EQ(::recv(fd, &byte, 1, 0), 0) << c.name;
+    ::close(fd);
+    ++invalidations;
+    ASSERT_TRUE(server.serverEvents.waitFor(++serverEvents)) << c.name;
+    EXPECT_EQ(server.serverEvents.count("connection invalid"), invalidations) << c.name;
+    std::vector<std::string> lines = log.lines();
+    ASSERT_EQ(lines.size(), 1u) << c.name;
+    EXPECT_EQ(lines[0].rfind("closing connection from pid " + std::to_string(::getpid()) + ": ", 0),
+              0u)
+        << lines[0];
+    EXPECT_NE(lines[0].find(c.reason), std::string::npos) << lines[0];
+
+    // The well-behaved client is still served.
+    ASSERT_TRUE(good->sendWithReply(Dictionary{{"after", Value(c.name)}}, replyQueue,
+                                    [replies](const Event& e) { replies->add(eventText(e)); })
+                    .has_value());
+    ++serverEvents;
+    ASSERT_TRUE(replies->waitFor(invalidations)) << c.name;
+    EXPECT_FALSE(replies->events().back() == "connection invalid") << c.name;
+  }
+  EXPECT_TRUE(events->events().empty());
+}
+
+TEST(ConnectionTest, PeerThatStopsReadingIsDisconnectedPastTheBound) {
+  testing::TempDir dir;
+  std::string path = dir.file("svc");
+  EchoServer server(path);
+  server.setOutputLimit(1024 * 1024);
+  base::LogCapture log;
+  int fd = rawConnect(path);
+  Bytes flood = frameOf(FrameKind::kMessage, 1, Dictionary{{"flood", Value::integer(1)}});
+  ASSERT_EQ(::send(fd, flood.data(), flood.size(), MSG_NOSIGNAL),
+            static_cast<ssize_t>(flood.size()));
+  // Never read: 16 MiB of output cannot fit in a 1 MiB bound plus the socket buffer.
+  ASSERT_TRUE(server.serverEvents.waitFor(2));
+  EXPECT_EQ(server.serverEvents.events()[1], "connection invalid");
+  EXPECT_TRUE(log.contains("peer is not reading"));
+  ::close(fd);
+}
+
+TEST(ConnectionTest, ListenerReplacesStaleSocketsOnly) {
+  testing::TempDir dir;
+  auto queue = makeQueue("lmo-test");
+
+  // A socket file nobody listens on any more.
+  std::string stale = dir.file("stale");
+  int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::memcpy(addr.sun_path, stale.data(), stale.size());
+  ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  ::close(fd);
+  auto replaced = Listener::create(stale, queue);
+  ASSERT_TRUE(replaced.has_value()) << replaced.error().description();
+
+  // A live listener is not disturbed.
+  auto second = Listener::create(stale, queue);
+  ASSERT_FALSE(second.has_value());
+  EXPECT_NE(second.error().description().find("already running"), std::string::npos);
+  auto events = recorder(), replies = recorder();
+  replaced.value()->setConnectionHandler([events](std::shared_ptr<Connection> c) {
+    events->add("accepted");
+    c->setEventHandler([](const Event&) {});
+    c->resume();
+  });
+  replaced.value()->resume();
+  auto client = connectRecorded(stale, replies);
+  ASSERT_TRUE(events->waitFor(1));
+
+  // Something that is not a socket is never removed.
+  std::string file = dir.write("plain", "keep me");
+  auto onFile = Listener::create(file, queue);
+  ASSERT_FALSE(onFile.has_value());
+  EXPECT_NE(onFile.error().description().find("not a socket"), std::string::npos);
+
+  // A relative name lives in the runtime directory.
+  ::setenv("VANTREL_RUNTIME_DIR", dir.file("run").c_str(), 1);
+  auto named = Listener::create("com.example.test", queue);
+  ::unsetenv("VANTREL_RUNTIME_DIR");
+  ASSERT_TRUE(named.has_value());
+  EXPECT_EQ(named.value()->path(), dir.file("run") + "/com.example.test");
+  named.value()->cancel();
+  replaced.value()->cancel();
+  client->cancel();
+  ASSERT_TRUE(replies->waitFor(1));
+}
+
+TEST(ConnectionTest, TerminationImminentReachesHandlersAndChangesNothingElse) {
+  testing::TempDir dir;
+  std::string path = dir.file("svc");
+  EchoServer server(path);
+  auto events = recorder(), replies = recorder();
+  auto c = connectRecorded(path, events);
+  auto replyQueue = makeQueue("replies");
+  auto ping = [&] {
+    ASSERT_TRUE(c->sendWithReply(Dictionary{{"p", Value::integer(1)}}, replyQueue,
+                                 [replies](const Event& e) { replies->add(eventText(e)); })
+                    .has_value());
+  };
+  ping();
+  ASSERT_TRUE(replies->waitFor(1));  // the connection is accepted and live on both ends
+  IoLoop::shared().announceTerminationImminent();
+  ASSERT_TRUE(events->waitFor(1));
+  EXPECT_EQ(events->events()[0], "termination imminent");
+  ping();
+  ASSERT_TRUE(replies->waitFor(2));
+  EXPECT_NE(replies->events()[1], "connection invalid");
+  c->cancel();
+  ASSERT_TRUE(events->waitFor(2));
+}
+
+}  // namespace
+}  // namespace vantrel::lmo
