@@ -9,6 +9,7 @@
 #include <string>
 
 #include "platform/AtomicFile.h"
+#include "platform/FileLock.h"
 #include "platform/Paths.h"
 
 namespace vantrel::platform {
@@ -43,31 +44,6 @@ uint64_t readCounter(const std::string& path) {
   return value;
 }
 
-// Holds an exclusive flock for as long as it lives. Each instance opens its
-// own descriptor, so two threads of one process exclude each other too.
-class LockFile {
- public:
-  LockFile() = default;
-  ~LockFile() {
-    if (fd_ >= 0) ::close(fd_);  // closing the last descriptor drops the lock
-  }
-  LockFile(const LockFile&) = delete;
-  LockFile& operator=(const LockFile&) = delete;
-
-  // 0 or errno.
-  int acquire(const std::string& path) {
-    fd_ = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, kFileMode);
-    if (fd_ < 0) return errno;
-    while (::flock(fd_, LOCK_EX) != 0) {
-      if (errno != EINTR) return errno;
-    }
-    return 0;
-  }
-
- private:
-  int fd_ = -1;
-};
-
 }  // namespace
 
 std::string notificationDirectory() {
@@ -83,8 +59,8 @@ base::Result<uint64_t> postNotification(std::string_view name) {
     return made.error();
   }
   const std::string lockPath = dir + "/" + kLockFileName;
-  LockFile lock;
-  if (int err = lock.acquire(lockPath)) return posixError(err, "cannot lock", lockPath);
+  FileLock lock;
+  if (int err = lock.lockFile(lockPath, kFileMode)) return posixError(err, "cannot lock", lockPath);
 
   const std::string path = dir + "/" + std::string(name);
   const uint64_t next = readCounter(path) + 1;

@@ -11,6 +11,7 @@
 #include "base/Check.h"
 #include "base/Log.h"
 #include "platform/AtomicFile.h"
+#include "platform/FileLock.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 
@@ -73,30 +74,6 @@ base::Result<lmo::Dictionary> readDomain(int fd, const struct stat& st, const st
   }
   return *dictionary;
 }
-
-// Holds an exclusive flock on a directory for as long as it lives.
-class DirectoryLock {
- public:
-  DirectoryLock() = default;
-  ~DirectoryLock() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  DirectoryLock(const DirectoryLock&) = delete;
-  DirectoryLock& operator=(const DirectoryLock&) = delete;
-
-  // 0 or errno.
-  int acquire(const std::string& directory) {
-    fd_ = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd_ < 0) return errno;
-    while (::flock(fd_, LOCK_EX) != 0) {
-      if (errno != EINTR) return errno;
-    }
-    return 0;
-  }
-
- private:
-  int fd_ = -1;
-};
 
 }  // namespace
 
@@ -166,8 +143,9 @@ base::Result<void> Preferences::synchronizeLocked(bool force) {
 base::Result<void> Preferences::setValue(std::string_view key, const lmo::Value& value) {
   std::lock_guard lock(mutex_);
   VT_TRY(ensureDirectory(directory_, kDirectoryMode));
-  DirectoryLock writers;
-  if (int err = writers.acquire(directory_)) return posixError(err, "cannot lock", directory_);
+  FileLock writers;
+  if (int err = writers.lockDirectory(directory_))
+    return posixError(err, "cannot lock", directory_);
 
   if (auto current = synchronizeLocked(/*force=*/true); !current.has_value()) {
     // Replacing the file would lose whatever its owner meant to keep in it.
