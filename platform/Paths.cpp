@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <system_error>
 
+#include "lmo/ServicePath.h"
 #include "platform/AtomicFile.h"
 
 namespace vantrel::platform {
@@ -30,10 +31,9 @@ std::string stateDirectory() {
 }
 
 std::string runtimeDirectory() {
-  if (const char* dir = environment("VANTREL_RUNTIME_DIR")) return dir;
-  if (::geteuid() == 0) return "/run/vantrel";
-  if (const char* dir = environment("XDG_RUNTIME_DIR")) return std::string(dir) + "/vantrel";
-  return "/tmp/vantrel-" + std::to_string(::geteuid());
+  // The IPC layer, below this one, needs the same directory for its sockets;
+  // the rule lives there so the two can never disagree.
+  return lmo::serviceRuntimeDirectory();
 }
 
 std::string preferencesDirectory() {
