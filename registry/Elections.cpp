@@ -15,17 +15,22 @@ std::optional<lmo::Dictionary> VTDatabase::annotationForPlugIn(const VTDPlugIn& 
   return annotation;
 }
 
-std::optional<base::Error> VTDatabase::setAnnotation(
-    const std::optional<lmo::Dictionary>& annotation, const VTDPlugIn& plugIn) {
-  sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn); });
-  // Posted off the queue: watchers that react by asking the daemon must not
-  // find the queue still held. The notification carries nothing, so a post
-  // that fails costs watchers one refresh; it is logged and not reported.
+void postAnnotationChange() {
+  // The notification carries nothing, so a post that fails costs watchers
+  // one refresh; it is logged and not reported.
   base::Result<uint64_t> posted = platform::postNotification(kAnnotationChangeNotification);
   if (!posted.has_value()) {
     base::vtlog("unable to post notification %@: %@", kAnnotationChangeNotification,
                 posted.error());
   }
+}
+
+std::optional<base::Error> VTDatabase::setAnnotation(
+    const std::optional<lmo::Dictionary>& annotation, const VTDPlugIn& plugIn) {
+  sync_.sync([&] { annotations_->setAnnotation(annotation, plugIn); });
+  // Posted off the queue: watchers that react by asking the daemon must not
+  // find the queue still held.
+  postAnnotationChange();
   return std::nullopt;
 }
 

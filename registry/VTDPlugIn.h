@@ -15,6 +15,7 @@
 #include "lmo/Value.h"
 #include "model/VTPlugInCore.h"
 #include "omnidex/Records.h"
+#include "omnidex/Workspace.h"
 
 namespace vantrel::registry {
 
@@ -84,6 +85,15 @@ class VTDPlugIn : public model::VTPlugInCore {
   // value of the replace-plugin entitlement, else the identifier. Null only
   // for a record that has neither.
   std::optional<std::string> annotationKey() const;
+
+  // ---- Busy check ----
+
+  // Null when no instance of the plug-in runs; otherwise a conflict entry
+  // naming the running bundle under platform::kExtensionBundleIdentifierKey.
+  // An instance of any registered bundle with this plug-in's bundle
+  // identifier counts, so registry is asked for those bundles. Scans /proc:
+  // call it where a request may wait for that (the service queue).
+  std::optional<lmo::Dictionary> checkBusy(omnidex::Workspace& registry) const;
 
   // Every entry of info whose key does not begin with "DT" (case-sensitive);
   // empty for null.

@@ -40,6 +40,8 @@ namespace vantrel::registry {
 // database.
 inline constexpr std::string_view kAnnotationChangeNotification =
     "com.karvo.vantrel.annotation-change";
+// Posts kAnnotationChangeNotification; a failure is logged, not reported.
+void postAnnotationChange();
 // The cache limit a database starts with.
 inline constexpr uint32_t kDefaultCacheLimit = 150;
 

@@ -1,0 +1,186 @@
+#include "daemon/Transaction.h"
+
+#include <climits>
+#include <cstdlib>
+#include <memory>
+
+#include "base/Check.h"
+#include "base/Format.h"
+#include "base/Log.h"
+#include "daemon/VTDLmoClient.h"
+#include "daemon/VTDServer.h"
+#include "lmo/Message.h"
+#include "platform/Probes.h"
+
+namespace vantrel::daemon {
+
+namespace {
+
+// Canonical paths longer than this are treated as unresolvable, as a fixed
+// buffer of that size would.
+constexpr size_t kMaxCanonicalPathBytes = 1024;
+
+struct Operation {
+  std::string_view type;
+  void (Transaction::*run)();
+};
+
+// Looked up in this order, byte for byte. "match", "ready" and "access" are
+// not served yet, so they are "unrecognized request" like any unknown type.
+constexpr Operation kDispatchTable[] = {
+    {"add", &Transaction::addPlugIns},       {"remove", &Transaction::removePlugIns},
+    {"bulk", &Transaction::bulkPlugIns},     {"annotate", &Transaction::annotatePlugIns},
+    {"lock", &Transaction::lockDownPlugIns},
+};
+
+// The canonical form of an absolute path, or nullopt when it does not exist,
+// cannot be resolved, holds a NUL byte or resolves to something too long.
+std::optional<std::string> canonicalPath(const std::string& path) {
+  if (path.find('\0') != std::string::npos) return std::nullopt;
+  std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr),
+                                                       &std::free);
+  if (!resolved) return std::nullopt;
+  std::string canonical(resolved.get());
+  if (canonical.size() >= kMaxCanonicalPathBytes) return std::nullopt;
+  return canonical;
+}
+
+}  // namespace
+
+TransactionPtr Transaction::initWithRequest(lmo::IncomingMessage request,
+                                            std::shared_ptr<VTDLmoClient> client) {
+  return TransactionPtr(new Transaction(std::move(request), std::move(client)));
+}
+
+Transaction::Transaction(lmo::IncomingMessage request, std::shared_ptr<VTDLmoClient> client)
+    : client_(std::move(client)),
+      request_(std::move(request)),
+      reply_(lmo::createReply(request_)) {}
+
+const std::shared_ptr<VTDServer>& Transaction::server() const {
+  return client_->server();
+}
+
+std::shared_ptr<lmo::Connection> Transaction::connection() const {
+  return client_->connection();
+}
+
+void Transaction::dispatch() {
+  server()->mainQueue()->assertCurrent();
+  const lmo::Dictionary& body = request();
+  const std::string* type = body.get("request").getIfString();
+  version_ = body.get("version").getIfUInt64().value_or(0);
+  if (version_ != kOldestProtocolVersion && version_ != kCurrentProtocolVersion) {
+    failMessage(base::kErrorVersionMismatch,
+                base::format("unsupported protocol version %d (current %d)",
+                             static_cast<int32_t>(static_cast<uint32_t>(version_)),
+                             kCurrentProtocolVersion));
+    return;
+  }
+  if (!client_->acceptWork()) return;
+  const char* typeText = type ? type->c_str() : nullptr;
+  server()->debug("client %d request %s", client_->pid(), typeText);
+  probes::request(client_->pid(), typeText ? typeText : "(null)");
+  if (type == nullptr) {
+    failMessage(base::kErrorBadRequest, "invalid request format (missing type)");
+    return;
+  }
+  for (const Operation& operation : kDispatchTable) {
+    if (operation.type == *type) {
+      (this->*operation.run)();
+      return;
+    }
+  }
+  failMessage(base::kErrorBadRequest, "unrecognized request");
+}
+
+void Transaction::setReplyValue(std::string_view key, lmo::Value value) {
+  if (reply_) reply_->body = reply_->body.setting(key, std::move(value));
+}
+
+void Transaction::done() {
+  VT_CHECK(!replied_, "a transaction replied twice");
+  replied_ = true;
+  const lmo::Dictionary body = reply();
+  if (server()->verbose() >= kVerboseDumps) server()->debug("Replying %@", body);
+  probes::requestOutput(client_->pid(), [&] { return lmo::describe(body); });
+  std::shared_ptr<lmo::Connection> peer = connection();
+  if (!reply_ || !peer) return;
+  base::Result<void> sent = peer->sendReply(*reply_);
+  if (sent.has_value()) return;
+  // The reply cannot be framed (too large or too deep). The client still
+  // gets its one answer, as an error.
+  server()->log("unable to send reply to pid %d: %@", client_->pid(), sent.error());
+  lmo::Reply fallback{lmo::Dictionary{}, reply_->inReplyTo};
+  fallback.body = fallback.body.setting(
+      "errorcode", lmo::Value::unsignedInteger(static_cast<uint64_t>(base::kErrorBadRequest)));
+  fallback.body = fallback.body.setting("error", lmo::Value(sent.error().description()));
+  (void)peer->sendReply(fallback);
+}
+
+void Transaction::failMessage(int32_t code, std::string_view message) {
+  const uint64_t wire = static_cast<uint64_t>(static_cast<int64_t>(code));
+  setReplyValue("errorcode", lmo::Value::unsignedInteger(wire));
+  setReplyValue("error", lmo::Value(message));
+  done();
+}
+
+void Transaction::failError(int32_t code, const base::Error& error) {
+  if (error.domain == base::VTErrorDomain) {
+    failMessage(static_cast<int32_t>(error.code), error.localizedDescription.value_or(""));
+  } else {
+    failMessage(code, error.description());
+  }
+}
+
+bool Transaction::marshalPaths(const PathBlock& block) {
+  const std::optional<lmo::Array> paths = lmo::lmo_dictionary_get_array(request(), "paths");
+  if (!paths) {
+    failMessage(base::kErrorBadRequest, "invalid request format");
+    return false;
+  }
+  for (const lmo::Value& element : *paths) {
+    const std::string* path = element.getIfString();
+    if (path == nullptr) {
+      failMessage(base::kErrorBadRequest, "invalid request format");
+      return false;
+    }
+    if (path->empty() || path->front() != '/') {
+      failMessage(base::kErrorBadPath, base::format("absolute path required: %s", path->c_str()));
+      return false;
+    }
+    const std::optional<std::string> canonical = canonicalPath(*path);
+    if (!block(canonical.value_or(*path), canonical.has_value())) return false;
+  }
+  return true;
+}
+
+bool Transaction::processPaths(const PathBlock& block) {
+  const bool accepted = marshalPaths(block);
+  if (accepted) done();
+  return accepted;
+}
+
+bool Transaction::processUuidList(const PlugInBlock& block) {
+  const std::optional<lmo::Array> uuids = lmo::lmo_dictionary_get_array(request(), "uuids");
+  if (!uuids) {
+    failMessage(base::kErrorBadRequest, "invalid request format (uuid)");
+    return false;
+  }
+  for (const lmo::Value& element : *uuids) {
+    const base::Uuid* uuid = element.getIfUuid();
+    if (uuid == nullptr) {
+      failMessage(base::kErrorBadRequest, "invalid request (bad uuid array)");
+      return false;
+    }
+    registry::VTDPlugInPtr plugIn = server()->findPlugIn(*uuid);
+    if (!plugIn) {
+      failMessage(base::kErrorBadRequest, "no such plugin (uuid not found)");
+      return false;
+    }
+    if (!block(plugIn)) return false;
+  }
+  return true;
+}
+
+}  // namespace vantrel::daemon

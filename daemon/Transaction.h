@@ -1,0 +1,99 @@
+#pragma once
+// One request being served: the envelope checks, the dispatch to the
+// request's operation and the one reply.
+//
+// A transaction is made on the connection's event queue and runs dispatch()
+// once on the service queue; everything else here runs there too. It holds
+// its client (and through it the server) until it has replied. Every path
+// through an operation ends in exactly one done() or fail...() call; a
+// second reply stops the process.
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "base/Error.h"
+#include "lmo/Connection.h"
+#include "lmo/Event.h"
+#include "lmo/Value.h"
+#include "registry/VTDPlugIn.h"
+
+namespace vantrel::daemon {
+
+class VTDLmoClient;
+class VTDServer;
+
+// The protocol version this daemon speaks, and the oldest it still serves.
+inline constexpr uint64_t kCurrentProtocolVersion = 3;
+inline constexpr uint64_t kOldestProtocolVersion = 2;
+
+class Transaction : public std::enable_shared_from_this<Transaction> {
+ public:
+  // Gets (path, resolved): the canonical path and true, or the path as sent
+  // and false when it could not be made canonical. Returns false to stop.
+  using PathBlock = std::function<bool(const std::string& path, bool resolved)>;
+  // Gets each plug-in named by the request; returns false to stop.
+  using PlugInBlock = std::function<bool(const registry::VTDPlugInPtr& plugIn)>;
+
+  static std::shared_ptr<Transaction> initWithRequest(lmo::IncomingMessage request,
+                                                      std::shared_ptr<VTDLmoClient> client);
+
+  // Checks the envelope and runs the request's operation. Service queue.
+  void dispatch();
+
+  // Sends the reply as it stands.
+  void done();
+  // Adds "errorcode" (code, sign-extended) and "error" to the reply and
+  // sends it.
+  void failMessage(int32_t code, std::string_view message);
+  // As failMessage with the error's own code and description for an error
+  // of the system's domain, else with code and the error's description.
+  void failError(int32_t code, const base::Error& error);
+
+  // Decodes "paths", handing each to block. On a decoding error it replies
+  // itself and returns false; otherwise it sends nothing and returns whether
+  // every path was accepted.
+  bool marshalPaths(const PathBlock& block);
+  // marshalPaths, then done() when every path was accepted.
+  bool processPaths(const PathBlock& block);
+  // Decodes "uuids" and looks each plug-in up, handing it to block. Replies
+  // itself on a decoding or lookup error; sends nothing on success.
+  bool processUuidList(const PlugInBlock& block);
+
+  // ---- Operations, one per request type ----
+  void addPlugIns();
+  void removePlugIns();
+  void bulkPlugIns();
+  void annotatePlugIns();
+  void lockDownPlugIns();
+
+  // ---- Accessors ----
+  const std::shared_ptr<VTDLmoClient>& client() const { return client_; }
+  const lmo::Dictionary& request() const { return request_.body(); }
+  // The reply so far; empty for a message that expects no reply.
+  lmo::Dictionary reply() const { return reply_ ? reply_->body : lmo::Dictionary(); }
+  // Adds key to the reply (nothing for a message that expects no reply).
+  void setReplyValue(std::string_view key, lmo::Value value);
+  uint64_t version() const { return version_; }
+  const std::shared_ptr<VTDServer>& server() const;
+  std::shared_ptr<lmo::Connection> connection() const;
+
+ private:
+  Transaction(lmo::IncomingMessage request, std::shared_ptr<VTDLmoClient> client);
+
+  // Constant after construction.
+  const std::shared_ptr<VTDLmoClient> client_;
+  const lmo::IncomingMessage request_;
+
+  // Owned by the service queue.
+  std::optional<lmo::Reply> reply_;
+  uint64_t version_ = 0;
+  bool replied_ = false;
+};
+
+using TransactionPtr = std::shared_ptr<Transaction>;
+
+}  // namespace vantrel::daemon

@@ -1,0 +1,119 @@
+#include "daemon/VTDLmoClient.h"
+
+#include "base/Format.h"
+#include "daemon/Transaction.h"
+#include "daemon/VTDServer.h"
+#include "model/FileUrl.h"
+#include "platform/Probes.h"
+#include "platform/ProcessInfo.h"
+
+namespace vantrel::daemon {
+
+VTDLmoClientPtr VTDLmoClient::initWithConnection(std::shared_ptr<lmo::Connection> connection,
+                                                 std::shared_ptr<VTDServer> server) {
+  VTDLmoClientPtr client(new VTDLmoClient());
+  client->connection_ = connection;
+  client->server_ = std::move(server);
+  client->identifyPeer(*connection);
+  connection->setContext(client);
+  connection->setEventHandler([client](const lmo::Event& event) { client->handleEvent(event); });
+  connection->resume();
+  return client;
+}
+
+VTDLmoClient::~VTDLmoClient() = default;
+
+void VTDLmoClient::identifyPeer(const lmo::Connection& connection) {
+  pid_ = connection.pid();
+  const std::optional<std::string> executable = platform::processExecutablePath(pid_);
+  if (executable) {
+    bundle_ = model::VTBundle::initWithExecutableURL(model::FileUrl::fromPath(*executable));
+  }
+  server_->debug("client %d %s", pid_, executable ? executable->c_str() : "(unknown executable)");
+  probes::clientNew(pid_);
+  base::Result<platform::CodeSigningTaskPtr> task =
+      platform::CodeSigningTask::create(pid_, connection.pidfd());
+  if (task.has_value()) {
+    task_ = std::move(task).value();
+  } else {
+    taskError_ = task.error();
+  }
+}
+
+void VTDLmoClient::handleEvent(const lmo::Event& event) {
+  if (const lmo::IncomingMessage* message = event.message()) {
+    handleMessage(*message);
+    return;
+  }
+  switch (*event.error()) {
+    case lmo::ErrorEvent::kTerminationImminent:
+      dying();
+      return;
+    case lmo::ErrorEvent::kConnectionInvalid:
+      dead();
+      return;
+  }
+  server_->log("unexpected error %@", event);
+}
+
+void VTDLmoClient::handleMessage(const lmo::IncomingMessage& message) {
+  if (server_->verbose() >= kVerboseDumps) server_->debug("incoming request %@", message.body());
+  probes::requestInput(pid_, [&] { return lmo::describe(message.body()); });
+  std::shared_ptr<Transaction> transaction =
+      Transaction::initWithRequest(message, shared_from_this());
+  server_->submitWork([transaction] {
+    transaction->client()->countRequest();
+    transaction->dispatch();
+  });
+}
+
+void VTDLmoClient::countRequest() {
+  server_->mainQueue()->assertCurrent();
+  ++requestCount_;
+  if (requestCount_ % kRequestCountReportInterval == 0) {
+    server_->debug("client %d used %u requests so far", pid_, requestCount_);
+  }
+}
+
+uint32_t VTDLmoClient::requestCount() const {
+  server_->mainQueue()->assertCurrent();
+  return requestCount_;
+}
+
+void VTDLmoClient::dying() {
+  server_->debug("client %d termination imminent", pid_);
+}
+
+void VTDLmoClient::dead() {
+  server_->unholdClient(*this);
+  server_->debug("client %d is dead", pid_);
+  setAcceptWork(false);
+  probes::clientDone(pid_);
+}
+
+lmo::Value VTDLmoClient::entitlementValueForKey(std::string_view key) const {
+  if (!task_) {
+    server_->log("error retrieving entitlements for pid %d", pid_);
+    return lmo::Value();
+  }
+  platform::CodeSigningTask::Entitlement entitlement = task_->copyValueForEntitlement(key);
+  if (entitlement.error) server_->log("error retrieving entitlements for pid %d", pid_);
+  return entitlement.value;
+}
+
+bool VTDLmoClient::hasEntitlement(std::string_view key) const {
+  const lmo::Value value = entitlementValueForKey(key);
+  return !value.isNull() && !(value == lmo::Value::boolean(false));
+}
+
+std::string VTDLmoClient::description() const {
+  const std::shared_ptr<lmo::Connection> connection = connection_.lock();
+  if (!connection) return base::format("<VTDLmoClient %p NO CONNECTION>", this);
+  return base::format("<VTDLmoClient %p pid=%d con=%@>", this, pid_, *connection);
+}
+
+std::string describe(const VTDLmoClient& client) {
+  return client.description();
+}
+
+}  // namespace vantrel::daemon
