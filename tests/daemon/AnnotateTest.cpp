@@ -1,0 +1,78 @@
+// The annotate request: the shape of the change, what is stored, and the
+// file it leaves.
+
+#include <gtest/gtest.h>
+
+#include "base/Log.h"
+#include "platform/NotificationCenter.h"
+#include "platform/PropertyList.h"
+#include "registry/VTDatabase.h"
+#include "tests/daemon/DaemonFixture.h"
+
+namespace vantrel::daemon::testing {
+namespace {
+
+using lmo::Array;
+using lmo::Dictionary;
+using lmo::Value;
+using Expected = std::pair<int64_t, std::string>;
+
+using Annotate = DaemonTest;
+
+TEST_F(Annotate, MalformedChangesTouchNothing) {
+  const Value uuids = Array{uuidOf("widget")};
+  struct Case {
+    Value annotations;
+    Expected expected;
+  };
+  const Case cases[] = {
+      {Value(), {4, "invalid request format (bad annotations dictionary)"}},
+      {Array{}, {4, "invalid request format (bad annotations dictionary)"}},
+      {Dictionary{{"election", "1"}}, {4, "invalid request format (annotation election)"}},
+      {Dictionary{{"extension", Array{}}}, {4, "invalid request format (annotation extension)"}},
+      {Dictionary{{"election", "1"}, {"extension", Array{}}},
+       {4, "invalid request format (annotation election)"}},
+  };
+  for (const Case& c : cases) {
+    Dictionary extras{{"uuids", uuids}};
+    if (!c.annotations.isNull()) extras = extras.setting("annotations", c.annotations);
+    EXPECT_EQ(errorOf(request("annotate", extras)), c.expected) << lmo::describe(c.annotations);
+  }
+  // A change without a known key succeeds without looking at "uuids".
+  EXPECT_EQ(errorOf(request("annotate", {{"annotations", Dictionary{{"colour", "red"}}},
+                                         {"uuids", "garbage"}})),
+            Expected(0, ""));
+  EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), std::nullopt);
+  EXPECT_EQ(platform::notificationCount(registry::kAnnotationChangeNotification), 0u);
+}
+
+TEST_F(Annotate, StoresTheKnownKeysAndAnnounces) {
+  base::LogCapture log;
+  const Dictionary settings{{"size", Value::integer(2)}};
+  const Dictionary reply =
+      request("annotate", {{"uuids", Array{uuidOf("widget"), uuidOf("share")}},
+                           {"annotations", Dictionary{{"election", Value::integer(0)},
+                                                      {"extension", settings},
+                                                      {"colour", "red"}}}});
+  EXPECT_TRUE(reply.empty()) << lmo::describe(reply);
+  const Dictionary stored{{"election", Value::integer(0)}, {"extension", settings}};
+  EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), stored);
+  EXPECT_EQ(server_->annotationForPlugIn(*plugIn("share")), stored);
+  EXPECT_EQ(platform::notificationCount(registry::kAnnotationChangeNotification), 2u);
+  EXPECT_TRUE(log.contains(" plug-in com.x.widget election := 0"));
+
+  // Only the extension: the election stays, and the log shows none given.
+  request("annotate", {{"uuids", Array{uuidOf("widget")}},
+                       {"annotations", Dictionary{{"extension", Dictionary{}}}}});
+  EXPECT_TRUE(log.contains(" plug-in com.x.widget election := (null)"));
+
+  // The store's file on disk is what a restarted daemon reads.
+  auto file = platform::readPropertyListFile(annotations_);
+  ASSERT_TRUE(file.has_value()) << file.error().description();
+  const std::string text = lmo::describe(file.value());
+  EXPECT_NE(text.find("com.x.widget"), std::string::npos) << text;
+  EXPECT_EQ(text.find("colour"), std::string::npos) << text;
+}
+
+}  // namespace
+}  // namespace vantrel::daemon::testing

@@ -1,0 +1,71 @@
+#pragma once
+// A daemon served in the test's own process: a real registry over a bundle
+// tree in a temporary directory, a real socket, and connections that send
+// requests and wait for their replies.
+
+#include <gtest/gtest.h>
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "daemon/VTDServer.h"
+#include "lmo/Connection.h"
+#include "lmo/Value.h"
+#include "omnidex/Omnidex.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::daemon::testing {
+
+// The application every test starts with: <apps>/Host.app holding the
+// plug-ins "com.x.widget" and "com.x.share", each with the test peer as
+// its executable.
+inline constexpr const char* kWidget = "com.x.widget";
+inline constexpr const char* kShare = "com.x.share";
+
+class DaemonTest : public ::testing::Test {
+ protected:
+  void SetUp() override;
+  void TearDown() override;
+
+  // A plug-in bundle's Info.plist text for identifier, naming the test peer
+  // ("peer") as its executable.
+  static lmo::Dictionary plugInInfo(const std::string& identifier);
+  // Writes a plug-in bundle at the temporary-directory-relative path, with
+  // the test peer installed as its executable; returns its absolute path.
+  std::string writePlugIn(const std::string& relative, const std::string& identifier);
+  std::string hostApp() const { return tmp_.file("apps/Host.app"); }
+  std::string plugInPath(const char* name) const {
+    return hostApp() + "/PlugIns/" + name + ".appex";
+  }
+  registry::VTDPlugInPtr plugIn(const char* name) const;
+  base::Uuid uuidOf(const char* name) const { return *plugIn(name)->uuid(); }
+
+  std::shared_ptr<lmo::Connection> connect();
+  // Sends message on connection (a fresh one when null) and waits for the
+  // reply: its body, or nullopt (after a test failure) when none came.
+  std::optional<lmo::Dictionary> send(const lmo::Dictionary& message,
+                                      const std::shared_ptr<lmo::Connection>& connection = nullptr);
+  // {"request": type, "version": 3} plus extras, sent and answered.
+  lmo::Dictionary request(const char* type, lmo::Dictionary extras = {},
+                          const std::shared_ptr<lmo::Connection>& connection = nullptr);
+  // Polls until condition holds or five seconds pass; whether it held.
+  static bool eventually(const std::function<bool()>& condition);
+
+  vantrel::testing::TempDir tmp_;
+  std::string socket_;
+  std::string annotations_;
+  std::shared_ptr<omnidex::Omnidex> registry_;
+  VTDServerPtr server_;
+
+ private:
+  std::map<std::string, std::optional<std::string>> savedEnvironment_;
+  lmo::QueuePtr replyQueue_ = std::make_shared<base::SerialQueue>("test-replies");
+  std::vector<std::shared_ptr<lmo::Connection>> connections_;
+};
+
+// The error reply's (code, message), or (0, "") for a success.
+std::pair<int64_t, std::string> errorOf(const lmo::Dictionary& reply);
+
+}  // namespace vantrel::daemon::testing
