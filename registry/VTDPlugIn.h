@@ -28,6 +28,8 @@ inline constexpr std::string_view kAutoElectEntitlement = "com.karvo.developer.a
 // Extension dictionary key that sets the hub protocol version.
 inline constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
 
+class VTDatabase;
+
 class VTDPlugIn : public model::VTPlugInCore {
  public:
   // Hub protocol versions of plug-ins that do not declare one.
@@ -86,6 +88,32 @@ class VTDPlugIn : public model::VTPlugInCore {
   // for a record that has neither.
   std::optional<std::string> annotationKey() const;
 
+  // ---- Match rules ----
+  // A rule dictionary maps keys naming a property of the plug-in to patterns
+  // that property must satisfy; every key must hold. See docs/match-rules.md.
+  // Nothing here fails: a value or pattern of an unexpected kind fails the
+  // key. Callable from any thread; "QXUserElection" enters the database's
+  // queue, so not from that queue.
+
+  // Every key of rules holds; absent or empty rules match every plug-in.
+  bool match(const std::optional<lmo::Dictionary>& rules) const;
+  // One key of a rule dictionary against its pattern.
+  bool matchKey(std::string_view key, const lmo::Value& pattern) const;
+  // A string value against one operator pattern or an array of them (any).
+  bool matchValuePatterns(std::string_view value, const lmo::Value& patterns) const;
+  // A string value against one operator pattern.
+  bool matchValuePattern(std::string_view value, std::string_view pattern) const;
+  // The value as an activation rule, the pattern as the host's extension
+  // items.
+  bool matchDictionary(const lmo::Value& value, const lmo::Dictionary& pattern) const;
+  // The election as "QXUserElection" tests it: the stored election (0 when
+  // none) with bits 8 to 15 cleared, as signed 32-bit decimal text.
+  std::string electionText() const;
+
+  // The database whose annotations hold this record's election; set by the
+  // database that builds the record, before it is shared.
+  void setDatabase(std::weak_ptr<VTDatabase> database) { database_ = std::move(database); }
+
   // ---- Busy check ----
 
   // Null when no instance of the plug-in runs; otherwise a conflict entry
@@ -111,6 +139,7 @@ class VTDPlugIn : public model::VTPlugInCore {
   std::optional<std::string> lazyName(std::optional<std::string>& field, NameFetch fetch) const;
 
   omnidex::PlugInRecordPtr oxproxy_;  // Constant once the record is shared.
+  std::weak_ptr<VTDatabase> database_;  // Constant once the record is shared.
 
   // Guards the three names below: a first read stores what it fetched while
   // other threads may read or set the same field.

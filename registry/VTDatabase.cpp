@@ -47,6 +47,7 @@ VTDPlugInPtr VTDatabase::createPlugInForProxy(const omnidex::PlugInRecordPtr& re
   sync_.assertCurrent();
   VTDPlugInPtr plugIn = VTDPlugIn::initWithOXData(record);
   if (!plugIn) return nullptr;
+  plugIn->setDatabase(weak_from_this());
   if (plugIn->hasEntitlement(kAutoElectEntitlement)) autoElect(*plugIn);
   purgeCachesToLimit(static_cast<int32_t>(cacheLimit()));
   // initWithOXData never yields a record without uuid.
