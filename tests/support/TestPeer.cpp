@@ -6,23 +6,47 @@
 //   sleep      writes "ready\n" to standard output once running, then blocks
 //              until it is killed or its standard input is closed; exit 0.
 //   print-pid  writes its pid and "\n" to standard output; exit 0.
-// Anything else: a usage line on standard error, exit 2.
+//   connect <service>
+//              sends the daemon an "annotate" request with an empty
+//              annotation (answered without any work) and waits for the
+//              reply, so the daemon has certainly accepted the connection;
+//              writes "connected\n", then blocks until standard input closes;
+//              exit 0.
+//   hold <service> <flags> [<path>...]
+//              asks the daemon for a hold on the paths; writes
+//              "held <token>\n" when granted or "error <code> <message>\n"
+//              when refused, then blocks until standard input closes (the
+//              hold lasts as long as the connection); exit 0.
+// In the last two modes a connection that fails or a daemon that does not
+// answer within 30 s gives "error <code> <message>\n" and exit 1. Log lines go
+// to standard error. Anything else: a usage line on standard error, exit 2.
 //
-// It links nothing of the project, so that copying the one file is enough.
+// The project's libraries are linked statically, so copying the one file is
+// still enough.
 
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
-#include <cstring>
+#include <cstdlib>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "base/Log.h"
+#include "client/VTDaemonClient.h"
 
 namespace {
 
-constexpr int kUsageExit = 2;
+using vantrel::client::VTDaemonClient;
 
-int sleepUntilStdinCloses() {
-  std::fputs("ready\n", stdout);
-  std::fflush(stdout);
+constexpr int kConnectionFailedExit = 1;
+constexpr int kUsageExit = 2;
+constexpr std::chrono::milliseconds kReplyTimeout = std::chrono::seconds(30);
+
+int blockUntilStdinCloses() {
   char buffer[256];
   for (;;) {
     const ssize_t n = ::read(STDIN_FILENO, buffer, sizeof buffer);
@@ -31,16 +55,93 @@ int sleepUntilStdinCloses() {
   }
 }
 
+void printLine(const std::string& line) {
+  std::fputs(line.c_str(), stdout);
+  std::fputc('\n', stdout);
+  std::fflush(stdout);
+}
+
+void printError(const vantrel::base::Error& error) {
+  printLine(vantrel::base::format("error %d %s", error.code, error.description()));
+}
+
+int sleepUntilStdinCloses() {
+  printLine("ready");
+  return blockUntilStdinCloses();
+}
+
 int printPid() {
   std::printf("%d\n", static_cast<int>(::getpid()));
   return std::fflush(stdout) == 0 ? 0 : 1;
 }
 
+// The failure that left no answer from the daemon: no reply in time, or the
+// connection's error event instead of a reply.
+std::optional<vantrel::base::Error> transportFailure(
+    const vantrel::base::Result<vantrel::lmo::Event>& outcome) {
+  if (!outcome.has_value()) return outcome.error();
+  if (outcome.value().isError()) return VTDaemonClient::errorInReply(outcome.value());
+  return std::nullopt;
+}
+
+int connectAndWait(const char* service) {
+  auto client = VTDaemonClient::initWithServiceName(service);
+  auto message = client->request("annotate").setting("annotations", vantrel::lmo::Dictionary());
+  if (auto failure = transportFailure(client->sendSync(message, kReplyTimeout))) {
+    printError(*failure);
+    return kConnectionFailedExit;
+  }
+  printLine("connected");
+  return blockUntilStdinCloses();
+}
+
+int holdAndWait(const char* service, uint64_t flags, std::vector<std::string> paths) {
+  auto client = VTDaemonClient::initWithServiceName(service);
+  auto outcome = client->sendSyncWith(
+      [&](VTDaemonClient::ReplyHandler reply) {
+        return client->holdPlugins(paths, flags, std::move(reply));
+      },
+      kReplyTimeout);
+  if (auto failure = transportFailure(outcome)) {
+    printError(*failure);
+    return kConnectionFailedExit;
+  }
+  if (auto refused = VTDaemonClient::errorInReply(outcome.value())) {
+    printError(*refused);
+  } else if (auto token = outcome.value().message()->body().get("uuids").getIfUuid()) {
+    printLine("held " + token->string());
+  } else {
+    printLine("error 4 hold granted without a token");
+  }
+  return blockUntilStdinCloses();
+}
+
+std::optional<uint64_t> parseFlags(const char* text) {
+  if (*text < '0' || *text > '9') return std::nullopt;
+  char* end = nullptr;
+  errno = 0;
+  const unsigned long long value = std::strtoull(text, &end, 0);
+  if (errno != 0 || *end != '\0') return std::nullopt;
+  return value;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc == 2 && std::strcmp(argv[1], "sleep") == 0) return sleepUntilStdinCloses();
-  if (argc == 2 && std::strcmp(argv[1], "print-pid") == 0) return printPid();
-  std::fprintf(stderr, "usage: %s sleep|print-pid\n", argc > 0 ? argv[0] : "vantrel-test-peer");
+  vantrel::base::setLogSink([](vantrel::base::LogLevel, std::string_view line) {
+    std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
+  });
+  const std::string_view mode = argc >= 2 ? argv[1] : "";
+  if (argc == 2 && mode == "sleep") return sleepUntilStdinCloses();
+  if (argc == 2 && mode == "print-pid") return printPid();
+  if (argc == 3 && mode == "connect") return connectAndWait(argv[2]);
+  if (argc >= 4 && mode == "hold") {
+    if (auto flags = parseFlags(argv[3])) {
+      return holdAndWait(argv[2], *flags, std::vector<std::string>(argv + 4, argv + argc));
+    }
+  }
+  std::fprintf(stderr,
+               "usage: %s sleep|print-pid|connect <service>|hold <service> <flags> [<path>...]\n",
+               argc > 0 ? argv[0] : "vantrel-test-peer");
   return kUsageExit;
 }
