@@ -22,6 +22,7 @@
 #include "lmo/Value.h"
 #include "model/VTBundle.h"
 #include "platform/CodeSigning.h"
+#include "registry/VTDHost.h"
 
 namespace vantrel::daemon {
 
@@ -30,7 +31,7 @@ class VTDServer;
 // Requests of one client between two "used ... requests so far" lines.
 inline constexpr uint32_t kRequestCountReportInterval = 1000;
 
-class VTDLmoClient : public std::enable_shared_from_this<VTDLmoClient> {
+class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_this<VTDLmoClient> {
  public:
   // Identifies the peer of connection, makes itself the connection's
   // context, installs its event handler and resumes the connection. Runs on
@@ -38,20 +39,20 @@ class VTDLmoClient : public std::enable_shared_from_this<VTDLmoClient> {
   static std::shared_ptr<VTDLmoClient> initWithConnection(
       std::shared_ptr<lmo::Connection> connection, std::shared_ptr<VTDServer> server);
 
-  ~VTDLmoClient();
+  ~VTDLmoClient() override;
   VTDLmoClient(const VTDLmoClient&) = delete;
   VTDLmoClient& operator=(const VTDLmoClient&) = delete;
 
   // The peer's process id as the kernel gave it at connection time; kept
   // after the connection is gone.
-  pid_t pid() const { return pid_; }
+  pid_t pid() const override { return pid_; }
 
   // The value of one entitlement of the peer, or null. When the peer's
   // entitlements could not be read, "error retrieving entitlements for pid
   // %d" is logged and the value is null.
-  lmo::Value entitlementValueForKey(std::string_view key) const;
+  lmo::Value entitlementValueForKey(std::string_view key) const override;
   // The entitlement exists and is not false.
-  bool hasEntitlement(std::string_view key) const;
+  bool hasEntitlement(std::string_view key) const override;
 
   // "<VTDLmoClient %p pid=%d con=%@>", or "<VTDLmoClient %p NO CONNECTION>"
   // once the connection is gone.

@@ -143,5 +143,25 @@ TEST_F(Holds, ReleasedWhenTheClientGoesAway) {
   EXPECT_FALSE(server_->holdOnPlugIn(*plugIn("widget")));
 }
 
+TEST_F(Holds, ReleasedWhenTheClientProcessExits) {
+  base::LogCapture log;
+  auto peer = vantrel::testing::PeerProcess::start(vantrel::testing::testPeerPath(),
+                                                   {"hold", socket_, "2", plugInPath("widget")});
+  ASSERT_NE(peer, nullptr);
+  const std::optional<std::string> held = peer->readLine();
+  ASSERT_TRUE(held && held->starts_with("held ")) << held.value_or("(nothing)");
+  ASSERT_EQ(server_->holds().size(), 1u);
+  EXPECT_EQ(server_->holds().front()->uuid().string(), held->substr(5));
+  EXPECT_TRUE(server_->holdOnPlugIn(*plugIn("widget")));
+
+  peer->closeStdin();
+  peer->wait();
+  ASSERT_TRUE(eventually([&] { return server_->holds().empty(); }));
+  EXPECT_EQ(log.count("releasing plug-in hold " + held->substr(5) + " for dead client pid " +
+                      std::to_string(peer->pid())),
+            1u);
+  EXPECT_FALSE(server_->holdOnPlugIn(*plugIn("widget")));
+}
+
 }  // namespace
 }  // namespace vantrel::daemon::testing
