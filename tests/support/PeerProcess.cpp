@@ -14,6 +14,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <string_view>
 #include <system_error>
 
 extern char** environ;
@@ -37,8 +38,36 @@ bool installTestPeer(const std::string& path) {
   return ::chmod(path.c_str(), 0755) == 0;
 }
 
+namespace {
+
+// The name part of a "NAME=value" entry.
+std::string_view variableName(std::string_view entry) {
+  return entry.substr(0, entry.find('='));
+}
+
+// This process's environment with the entries of extra applied in order.
+std::vector<std::string> mergedEnvironment(const std::vector<std::string>& extra) {
+  std::vector<std::string> merged;
+  for (char** entry = environ; *entry != nullptr; ++entry) merged.emplace_back(*entry);
+  for (const std::string& entry : extra) {
+    std::erase_if(merged, [&](const std::string& existing) {
+      return variableName(existing) == variableName(entry);
+    });
+    merged.push_back(entry);
+  }
+  return merged;
+}
+
+}  // namespace
+
 std::unique_ptr<PeerProcess> PeerProcess::start(const std::string& executable,
                                                 const std::vector<std::string>& args) {
+  return start(executable, args, {});
+}
+
+std::unique_ptr<PeerProcess> PeerProcess::start(const std::string& executable,
+                                                const std::vector<std::string>& args,
+                                                const std::vector<std::string>& environment) {
   int in[2];
   int out[2];
   if (::pipe2(in, O_CLOEXEC) != 0) return nullptr;
@@ -52,13 +81,18 @@ std::unique_ptr<PeerProcess> PeerProcess::start(const std::string& executable,
   std::vector<char*> argv;
   for (std::string& s : argvStrings) argv.push_back(s.data());
   argv.push_back(nullptr);
+  std::vector<std::string> envStrings = mergedEnvironment(environment);
+  std::vector<char*> envp;
+  for (std::string& s : envStrings) envp.push_back(s.data());
+  envp.push_back(nullptr);
 
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
   posix_spawn_file_actions_adddup2(&actions, in[0], STDIN_FILENO);
   posix_spawn_file_actions_adddup2(&actions, out[1], STDOUT_FILENO);
   pid_t pid = -1;
-  const int rc = ::posix_spawn(&pid, executable.c_str(), &actions, nullptr, argv.data(), environ);
+  const int rc =
+      ::posix_spawn(&pid, executable.c_str(), &actions, nullptr, argv.data(), envp.data());
   posix_spawn_file_actions_destroy(&actions);
   ::close(in[0]);
   ::close(out[1]);

@@ -29,6 +29,12 @@ class PeerProcess {
   // started (the reason is written to standard error).
   static std::unique_ptr<PeerProcess> start(const std::string& executable,
                                             const std::vector<std::string>& args);
+  // As above, with environment entries ("NAME=value") on top of this
+  // process's own environment: an entry replaces any variable of that name,
+  // and a later entry an earlier one.
+  static std::unique_ptr<PeerProcess> start(const std::string& executable,
+                                            const std::vector<std::string>& args,
+                                            const std::vector<std::string>& environment);
   ~PeerProcess();
   PeerProcess(const PeerProcess&) = delete;
   PeerProcess& operator=(const PeerProcess&) = delete;
