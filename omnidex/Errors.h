@@ -21,7 +21,8 @@ enum OmnidexErrorCode : int64_t {
   kOmnidexNotRegistered = 6,    // unregistering a path the registry does not know
   kOmnidexStoreFailed = 7,      // the database could not be opened, read or written
   kOmnidexSchemaMismatch = 8,   // the database was written by another schema version
-  kOmnidexFull = 9,             // kMaxRegisteredPlugIns reached
+  kOmnidexFull = 9,             // kMaxRegisteredPlugIns or a privacy-consent limit reached
+  kOmnidexBadIdentifier = 10,   // a consent identifier empty, too long, or holding a NUL character
 };
 
 inline base::Error omnidexError(int64_t code, std::string message) {

@@ -25,6 +25,14 @@ inline constexpr size_t kMaxRegisteredPlugIns = 100000;
 // max_user_watches, which is met with the same log line).
 inline constexpr size_t kMaxWatches = 200000;
 
+// Longest application bundle identifier or service identifier in the
+// privacy-consent store; a longer one is refused.
+inline constexpr size_t kMaxConsentIdentifierLength = 255;
+// Services with an answer for one application, and answers in the whole
+// store; a new one beyond either is refused (changing an answer is not).
+inline constexpr size_t kMaxConsentEntriesPerApplication = 256;
+inline constexpr size_t kMaxConsentEntries = 100000;
+
 // The watcher waits for this much quiet after a change before it re-reads
 // the bundles, so that a copy in progress is read once, when it is done...
 inline constexpr std::chrono::milliseconds kWatchQuietPeriod{200};

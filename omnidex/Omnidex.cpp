@@ -42,10 +42,14 @@ base::Result<std::shared_ptr<Omnidex>> Omnidex::open(const OmnidexConfig& config
   std::optional<std::string> stateDirectory = normalizeBundlePath(config.stateDirectory);
   if (!stateDirectory) return badPath(config.stateDirectory);
   VT_TRY(platform::ensureDirectory(*stateDirectory, kStateDirectoryMode));
-  std::unique_ptr<Store> store = VT_TRY(Store::open(childPath(*stateDirectory, kStoreFileName)));
+  const std::string databasePath = childPath(*stateDirectory, kStoreFileName);
+  std::unique_ptr<Store> store = VT_TRY(Store::open(databasePath));
+  // After Store::open, which creates the database or checks its version.
+  std::unique_ptr<ConsentStore> consent = VT_TRY(ConsentStore::open(databasePath));
   std::shared_ptr<Omnidex> omnidex(new Omnidex());
   omnidex->state_ = std::make_unique<State>(scanRoots(config), std::move(store),
                                             childPath(*stateDirectory, kContainersDirectoryName));
+  omnidex->state_->consent = std::move(consent);
   VT_TRY(omnidex->state_->containers.open());
   VT_TRY(omnidex->state_->load());
   return omnidex;
@@ -180,8 +184,28 @@ base::Result<void> Omnidex::unregisterPlugIn(const std::string& path) {
 }
 
 void Omnidex::clearCaches() {
-  std::lock_guard write(state_->writeMutex);
-  state_->store->releaseMemory();
+  {
+    std::lock_guard write(state_->writeMutex);
+    state_->store->releaseMemory();
+  }
+  state_->consent->releaseMemory();
+}
+
+std::optional<std::vector<ConsentEntry>> Omnidex::privacyConsentEntries(
+    const std::string& appBundleIdentifier) {
+  base::Result<std::vector<ConsentEntry>> found = state_->consent->entries(appBundleIdentifier);
+  if (!found.has_value()) return std::nullopt;
+  return std::move(found).value();
+}
+
+base::Result<void> Omnidex::grantConsent(const std::string& appBundleIdentifier,
+                                         const std::string& serviceIdentifier) {
+  return state_->consent->setConsent(appBundleIdentifier, serviceIdentifier, true, currentDate());
+}
+
+base::Result<void> Omnidex::revokeConsent(const std::string& appBundleIdentifier,
+                                          const std::string& serviceIdentifier) {
+  return state_->consent->setConsent(appBundleIdentifier, serviceIdentifier, false, currentDate());
 }
 
 }  // namespace vantrel::omnidex

@@ -8,7 +8,8 @@
 // plug-in directories with the store, then follows them with inotify so that
 // an application copied in or deleted is announced within a second.
 // Plug-ins registered explicitly by path may live anywhere and survive
-// restarts.
+// restarts. The same database keeps the user's privacy-consent answers per
+// application (omnidex/ConsentStore.h).
 
 #include <memory>
 #include <string>
@@ -60,6 +61,21 @@ class Omnidex final : public Workspace {
   base::Result<void> registerPlugIn(const std::string& path) override;
   base::Result<void> unregisterPlugIn(const std::string& path) override;
   void clearCaches() override;
+  std::optional<std::vector<ConsentEntry>> privacyConsentEntries(
+      const std::string& appBundleIdentifier) override;
+
+  // Records that the user granted (revoked) the service to the application
+  // with that bundle identifier, now, replacing an earlier answer. The
+  // application need not be installed: consent belongs to its identifier.
+  // Errors (domain "Omnidex"), with the store left as it was:
+  // kOmnidexBadIdentifier for an empty identifier, one longer than
+  // kMaxConsentIdentifierLength or holding a NUL character; kOmnidexFull
+  // for a new answer beyond the limits of omnidex/Limits.h;
+  // kOmnidexStoreFailed.
+  base::Result<void> grantConsent(const std::string& appBundleIdentifier,
+                                  const std::string& serviceIdentifier);
+  base::Result<void> revokeConsent(const std::string& appBundleIdentifier,
+                                   const std::string& serviceIdentifier);
 
   // Brings the store up to date with the watched directories (and checks
   // every plug-in registered by path) now, announcing what changed, and

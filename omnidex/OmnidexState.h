@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "base/SerialQueue.h"
+#include "omnidex/ConsentStore.h"
 #include "omnidex/Containers.h"
 #include "omnidex/Indexes.h"
 #include "omnidex/Omnidex.h"
@@ -55,6 +56,10 @@ struct Omnidex::State {
 
   std::mutex writeMutex;
   std::unique_ptr<Store> store;  // Guarded by writeMutex.
+
+  // Set at open, then constant; thread-safe itself (it has its own
+  // connection and lock), so consent never waits for writeMutex.
+  std::unique_ptr<ConsentStore> consent;
 
   mutable std::shared_mutex indexMutex;
   Indexes indexes;  // Guarded by indexMutex; written only with writeMutex held too.

@@ -3,6 +3,8 @@
 //
 // Two tables: plugins (one row per registered plug-in bundle path) and
 // applications (one row per application that holds a registered plug-in).
+// The database holds a third, the privacy-consent table, which
+// omnidex/ConsentStore.h adds and uses through a connection of its own.
 // The Info.plist and trusted Entitlements.plist bytes are stored as they
 // were read, so a record rebuilt at the next start is the record that was
 // announced, whatever became of the bundle since. The schema version is the

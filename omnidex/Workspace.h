@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "base/Result.h"
+#include "omnidex/PrivacyConsent.h"
 #include "omnidex/Records.h"
 
 namespace vantrel::omnidex {
@@ -83,6 +84,12 @@ class Workspace {
   virtual base::Result<void> unregisterPlugIn(const std::string& path) = 0;
   // Drops whatever the registry caches beyond its indexes.
   virtual void clearCaches() = 0;
+
+  // The user's privacy-consent answers for the application with that bundle
+  // identifier, in service identifier order; empty when there are none.
+  // nullopt when the registry cannot answer (its store cannot be read).
+  virtual std::optional<std::vector<ConsentEntry>> privacyConsentEntries(
+      const std::string& appBundleIdentifier) = 0;
 };
 
 }  // namespace vantrel::omnidex

@@ -1,80 +1,25 @@
 #include "platform/CodeSigning.h"
 
-#include <sys/syscall.h>
-#include <unistd.h>
-
-#include <algorithm>
-#include <cerrno>
-#include <cstdlib>
-#include <cstring>
 #include <utility>
 
 #include "base/Format.h"
 #include "platform/BundleService.h"
 #include "platform/ProcessInfo.h"
 #include "platform/PropertyList.h"
-#include "platform/SmallFile.h"
 #include "platform/TrustedFile.h"
 
 namespace vantrel::platform {
 namespace {
 
-constexpr std::string_view kFdInfoPidField = "Pid:";
-
-base::Error noProcess(std::string message) {
-  return base::Error{kCodeSigningErrorDomain, kCodeSigningNoProcess, std::move(message)};
-}
-
 base::Error noExecutable(std::string message) {
   return base::Error{kCodeSigningErrorDomain, kCodeSigningNoExecutable, std::move(message)};
 }
 
-// The pid that pidfd stands for, from the "Pid:" line of its fdinfo: -1 (or
-// 0 on older kernels) once the process has been reaped; nullopt when pidfd
-// is not a pidfd at all.
-std::optional<long> pidOfPidfd(int pidfd) {
-  const SmallFileRead r =
-      readSmallFile(base::format("/proc/self/fdinfo/%d", pidfd), kMaxFdInfoBytes);
-  if (smallFileProblem(r, kMaxFdInfoBytes)) return std::nullopt;
-  const std::string_view text = r.bytes;
-  size_t at = 0;
-  while (at < text.size()) {
-    const size_t end = std::min(text.find('\n', at), text.size());
-    const std::string_view line = text.substr(at, end - at);
-    if (line.substr(0, kFdInfoPidField.size()) == kFdInfoPidField) {
-      const std::string digits(line.substr(kFdInfoPidField.size()));
-      char* stop = nullptr;
-      errno = 0;
-      const long pid = std::strtol(digits.c_str(), &stop, 10);
-      if (errno != 0 || stop == digits.c_str()) return std::nullopt;
-      return pid;
-    }
-    at = end + 1;
-  }
-  return std::nullopt;
-}
-
-// Succeeds while pidfd stands for a live process whose pid is pid.
+// Succeeds while pidfd stands for a live process whose pid is pid; any
+// failure is kCodeSigningNoProcess, with the reason the check gave.
 base::Result<void> checkProcess(pid_t pid, int pidfd) {
-  if (pid <= 0 || pidfd < 0) {
-    return noProcess(base::format("no process descriptor for pid %d", static_cast<int>(pid)));
-  }
-  // Signal 0 only asks whether the process is there; EPERM means it is,
-  // but is not ours to signal.
-  // Through syscall(2): glibc 2.36 declares pidfd_send_signal without C
-  // linkage for C++.
-  if (::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) != 0 && errno != EPERM) {
-    return noProcess(
-        base::format("process %d is gone: %s", static_cast<int>(pid), std::strerror(errno)));
-  }
-  std::optional<long> actual = pidOfPidfd(pidfd);
-  if (!actual) {
-    return noProcess(base::format("descriptor %d is not a process descriptor for pid %d", pidfd,
-                                  static_cast<int>(pid)));
-  }
-  if (*actual != pid) {
-    return noProcess(base::format("descriptor %d stands for pid %d, not pid %d", pidfd,
-                                  static_cast<int>(*actual), static_cast<int>(pid)));
+  if (base::Result<void> alive = checkProcessIdentity(pid, pidfd); !alive.has_value()) {
+    return base::Error{kCodeSigningErrorDomain, kCodeSigningNoProcess, alive.error().description()};
   }
   return base::Result<void>::success();
 }

@@ -38,8 +38,6 @@ enum CodeSigningErrorCode : int64_t {
 
 // Largest entitlements file read.
 inline constexpr size_t kMaxEntitlementsFileBytes = 256 * 1024;
-// Largest /proc/self/fdinfo entry read while checking a pidfd.
-inline constexpr size_t kMaxFdInfoBytes = 4096;
 
 inline constexpr const char* kBundleEntitlementsFileName = "Entitlements.plist";
 inline constexpr const char* kExecutableEntitlementsSuffix = ".entitlements.plist";

@@ -1,20 +1,86 @@
 #include "platform/ProcessInfo.h"
 
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
 #include <string>
+#include <string_view>
 
 #include "base/Format.h"
+#include "platform/AtomicFile.h"
+#include "platform/SmallFile.h"
 
 namespace vantrel::platform {
 namespace {
+
+constexpr std::string_view kFdInfoPidField = "Pid:";
 
 std::string procPath(pid_t pid, const char* entry) {
   return base::format("/proc/%d/%s", static_cast<int>(pid), entry);
 }
 
+base::Error posixError(int code, std::string message) {
+  return base::Error{kPosixErrorDomain, code, std::move(message)};
+}
+
+// The pid that pidfd stands for, from the "Pid:" line of its fdinfo: -1 (or
+// 0 on older kernels) once the process has been reaped; nullopt when pidfd
+// is not a pidfd at all.
+std::optional<long> pidOfPidfd(int pidfd) {
+  const SmallFileRead r =
+      readSmallFile(base::format("/proc/self/fdinfo/%d", pidfd), kMaxPidfdInfoBytes);
+  if (smallFileProblem(r, kMaxPidfdInfoBytes)) return std::nullopt;
+  const std::string_view text = r.bytes;
+  size_t at = 0;
+  while (at < text.size()) {
+    const size_t end = std::min(text.find('\n', at), text.size());
+    const std::string_view line = text.substr(at, end - at);
+    if (line.substr(0, kFdInfoPidField.size()) == kFdInfoPidField) {
+      const std::string digits(line.substr(kFdInfoPidField.size()));
+      char* stop = nullptr;
+      errno = 0;
+      const long pid = std::strtol(digits.c_str(), &stop, 10);
+      if (errno != 0 || stop == digits.c_str()) return std::nullopt;
+      return pid;
+    }
+    at = end + 1;
+  }
+  return std::nullopt;
+}
+
 }  // namespace
+
+base::Result<void> checkProcessIdentity(pid_t pid, int pidfd) {
+  if (pid <= 0 || pidfd < 0) {
+    return posixError(EINVAL,
+                      base::format("no process descriptor for pid %d", static_cast<int>(pid)));
+  }
+  // Signal 0 only asks whether the process is there; EPERM means it is,
+  // but is not ours to signal.
+  // Through syscall(2): glibc 2.36 declares pidfd_send_signal without C
+  // linkage for C++.
+  if (::syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) != 0 && errno != EPERM) {
+    const int error = errno;
+    return posixError(
+        error == EBADF || error == EINVAL ? EBADF : ESRCH,
+        base::format("process %d is gone: %s", static_cast<int>(pid), std::strerror(error)));
+  }
+  std::optional<long> actual = pidOfPidfd(pidfd);
+  if (!actual) {
+    return posixError(EBADF, base::format("descriptor %d is not a process descriptor for pid %d",
+                                          pidfd, static_cast<int>(pid)));
+  }
+  if (*actual != pid) {
+    return posixError(ESRCH, base::format("descriptor %d stands for pid %d, not pid %d", pidfd,
+                                          static_cast<int>(*actual), static_cast<int>(pid)));
+  }
+  return base::Result<void>::success();
+}
 
 std::optional<std::string> processExecutablePath(pid_t pid) {
   if (pid <= 0) return std::nullopt;

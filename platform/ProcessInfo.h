@@ -1,6 +1,7 @@
 #pragma once
-// What /proc tells about another process's executable. Every answer is a
-// snapshot: the process may exit, or exec another program, right after it.
+// What /proc tells about another process: whether a pidfd still stands for
+// it, and which executable it runs. Every answer is a snapshot: the process
+// may exit, or exec another program, right after it.
 
 #include <sys/types.h>
 
@@ -8,7 +9,12 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
+
 namespace vantrel::platform {
+
+// Largest /proc/self/fdinfo entry read while checking a pidfd.
+inline constexpr size_t kMaxPidfdInfoBytes = 4096;
 
 // Longest executable path read from /proc/<pid>/exe; a longer one reads as
 // none.
@@ -34,6 +40,15 @@ std::optional<FileIdentity> processExecutableIdentity(pid_t pid);
 
 // The file at path, following symbolic links; nullopt when there is none.
 std::optional<FileIdentity> fileIdentity(const std::string& path);
+
+// Succeeds while pidfd stands for a live process whose pid is pid. Callers
+// that read /proc/<pid> check before and after reading: while the process
+// stays alive its pid cannot go to another one, so what was read between two
+// successful checks was its own. Errors (domain "POSIX", the description
+// naming pid and pidfd): EINVAL for a pid or descriptor that cannot be one,
+// ESRCH when the process has exited (a zombie may still pass) or the pidfd
+// stands for another pid, EBADF when the descriptor is not a pidfd.
+base::Result<void> checkProcessIdentity(pid_t pid, int pidfd);
 
 // Whether pid runs in the mount namespace of this process. False when that
 // cannot be told.

@@ -61,6 +61,8 @@ struct CountingDelegate : VTDatabaseDelegate {
 class FakeWorkspace : public omnidex::Workspace {
  public:
   std::vector<PlugInRecordPtr> records;
+  // Privacy-consent answers by application bundle identifier.
+  std::map<std::string, std::vector<omnidex::ConsentEntry>> consent;
   bool failing = false;
   int cacheClears = 0;  // changed on the database queue only
 
@@ -85,6 +87,12 @@ class FakeWorkspace : public omnidex::Workspace {
   base::Result<void> registerPlugIn(const std::string&) override { return ok(); }
   base::Result<void> unregisterPlugIn(const std::string&) override { return ok(); }
   void clearCaches() override { ++cacheClears; }
+  std::optional<std::vector<omnidex::ConsentEntry>> privacyConsentEntries(
+      const std::string& appBundleIdentifier) override {
+    if (failing) return std::nullopt;
+    auto found = consent.find(appBundleIdentifier);
+    return found == consent.end() ? std::vector<omnidex::ConsentEntry>() : found->second;
+  }
 
  private:
   static base::Result<void> ok() { return base::Result<void>::success(); }

@@ -1,0 +1,59 @@
+#include "platform/DeviceRestrictions.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <limits>
+
+#include "platform/Preferences.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::platform {
+namespace {
+
+using lmo::Value;
+
+void usePreferences(const testing::TempDir& dir) {
+  ::setenv("VANTREL_PREFERENCES_DIR", dir.path().c_str(), 1);
+}
+
+TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
+  testing::TempDir dir, other;
+  usePreferences(dir);
+  EXPECT_EQ(maximumApplicationRating(), std::nullopt) << "no file";
+  // Another writer with a domain object of its own, as another process has.
+  Preferences writer(kRestrictionsDomain);
+  const struct {
+    Value stored;
+    std::optional<int64_t> expected;
+  } cases[] = {
+      {Value::integer(300), 300},
+      {Value::integer(600), 600},
+      {Value("300"), std::nullopt},
+      {Value::boolean(true), std::nullopt},
+      {Value::real(299.9), 299},
+      {Value::real(-1.5), -1},
+      {Value::real(1e300), std::numeric_limits<int64_t>::max()},
+      {Value(), std::nullopt},
+      {Value::integer(17), 17},
+  };
+  for (const auto& c : cases) {
+    ASSERT_TRUE(writer.setValue(kMaxApplicationRatingKey, c.stored).has_value());
+    EXPECT_EQ(maximumApplicationRating(), c.expected) << describe(c.stored);
+  }
+
+  // The process's own writer, and a switch to another store location.
+  usePreferences(other);
+  EXPECT_EQ(maximumApplicationRating(), std::nullopt);
+  ASSERT_TRUE(setMaximumApplicationRating(9).has_value());
+  EXPECT_EQ(maximumApplicationRating(), 9);
+  usePreferences(dir);
+  EXPECT_EQ(maximumApplicationRating(), 17);
+  ASSERT_TRUE(setMaximumApplicationRating(std::nullopt).has_value());
+  writer.synchronize();
+  EXPECT_TRUE(writer.valueForKey(kMaxApplicationRatingKey).isNull());
+  ::unsetenv("VANTREL_PREFERENCES_DIR");
+}
+
+}  // namespace
+}  // namespace vantrel::platform
