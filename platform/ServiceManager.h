@@ -2,18 +2,38 @@
 // The service manager's table of external services: a plug-in made
 // launchable by one host process. Enabling a plug-in for a host adds a
 // registration; uninstalling the plug-in removes every registration of its
-// bundle identifier and version. The table is kept in
-// <directory>/services.plist (an XML property list, replaced atomically on
-// every change) so that the process that launches plug-ins can read it:
+// bundle identifier and version; the host's exit removes all of its own.
+//
+// The table is kept in <directory>/services.plist (an XML property list,
+// mode 0600, replaced atomically on every change) so that a restarted
+// daemon finds it again:
 //   { "formatVersion": 1,
 //     "services": [ { "bundleIdentifier": text, "version": text, "pid": integer,
 //                     "executable": absolute path, "description": dictionary } ] }
+//
+// Each registration is also published for its host alone, as a launch
+// description that client/VTPlugInLauncher reads:
+//   <directory>/services/<host pid>/<bundle identifier>.plist
+// The services directory is 0711 (hosts may pass through, not list it); a
+// host's directory is 0700 and its files 0600, owned by the host's
+// effective uid and gid when the daemon runs as root (otherwise by the
+// daemon's own user, which then must be the hosts' user too). The format is
+// described in docs/launch-descriptions.md.
+//
+// The host is named by its pid and a pidfd, so a pid the kernel hands to
+// another process later never inherits a registration. The manager's own
+// thread polls the hosts' pidfds; when a host exits, its registrations and
+// its directory are removed and the table persisted.
 
 #include <sys/types.h>
 
 #include <cstddef>
 #include <functional>
+#include <map>
+#include <memory>
+#include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "base/Result.h"
@@ -26,6 +46,37 @@ namespace vantrel::platform {
 inline constexpr size_t kMaxExternalServiceRegistrations = 4096;
 inline constexpr int64_t kServicesFileFormatVersion = 1;
 
+inline constexpr int64_t kLaunchDescriptionFormatVersion = 1;
+// Largest launch description file written or read.
+inline constexpr size_t kMaxLaunchDescriptionBytes = 1024 * 1024;
+// Environment variables one launch description may carry.
+inline constexpr size_t kMaxLaunchEnvironmentVariables = 1024;
+// Longest bundle identifier a launch description is published under: the
+// file name "<identifier>.plist" must fit in NAME_MAX (255) bytes.
+inline constexpr size_t kMaxPublishedBundleIdentifierLength = 249;
+// Entries of one host's directory removed when it is cleared. The host owns
+// the directory and may fill it; beyond this the directory stays, with a
+// log line.
+inline constexpr size_t kMaxLaunchDirectoryEntries = 1024;
+// Largest /proc/<pid>/status read to learn a host's uid and gid (the
+// supplementary group list makes it grow).
+inline constexpr size_t kMaxProcessStatusBytes = 256 * 1024;
+
+// Keys of a launch description file.
+inline constexpr const char* kLaunchFormatVersionKey = "formatVersion";
+inline constexpr const char* kLaunchBundleIdentifierKey = "bundleIdentifier";
+inline constexpr const char* kLaunchVersionKey = "version";
+inline constexpr const char* kLaunchExecutableKey = "executable";
+inline constexpr const char* kLaunchHostPidKey = "hostPid";
+inline constexpr const char* kLaunchWorkingDirectoryKey = "workingDirectory";
+inline constexpr const char* kLaunchServiceKey = "LMOService";
+inline constexpr const char* kLaunchEnvironmentKey = "EnvironmentVariables";
+inline constexpr const char* kLaunchSandboxProfileKey = "_SandboxProfile";
+// The environment variable whose value becomes the working directory.
+inline constexpr const char* kLaunchHomeVariable = "HOME";
+// The profile assumed when a description names none: the confining one.
+inline constexpr const char* kDefaultSandboxProfile = "plugin";
+
 struct ExternalServiceRegistration {
   std::string bundleIdentifier;
   std::string version;  // may be empty: a bundle need not declare one
@@ -34,6 +85,38 @@ struct ExternalServiceRegistration {
   lmo::Dictionary description;  // the launch description the plug-in runs with
   bool operator==(const ExternalServiceRegistration&) const = default;
 };
+
+// A launch description as the launcher uses it.
+struct LaunchDescription {
+  std::string bundleIdentifier;
+  std::string version;
+  pid_t hostPid = 0;
+  std::string executablePath;
+  // "NAME=value" entries, sorted by name. Variables whose value is not a
+  // string, or whose name is empty or holds '=', cannot be part of an
+  // environment and are left out.
+  std::vector<std::string> environment;
+  std::string sandboxProfile;
+  // Absolute; nullopt when the environment has no absolute "HOME".
+  std::optional<std::string> workingDirectory;
+};
+
+// <directory>/services/<pid>
+std::string launchDirectoryPath(const std::string& directory, pid_t pid);
+// <directory>/services/<pid>/<bundleIdentifier>.plist
+std::string launchDescriptionPath(const std::string& directory, pid_t pid,
+                                  std::string_view bundleIdentifier);
+
+// The launch description file's value for a registration. Errors (domain
+// "POSIX"): EINVAL when the description's "LMOService" is not a dictionary,
+// or its "EnvironmentVariables" is not a dictionary or its
+// "_SandboxProfile" not a string; E2BIG beyond kMaxLaunchEnvironmentVariables.
+base::Result<lmo::Value> encodeLaunchDescription(const ExternalServiceRegistration& registration);
+
+// Reads a launch description file's value back. Errors: domain
+// "PropertyList", code kPropertyListMalformed, with what is wrong in the
+// description.
+base::Result<LaunchDescription> decodeLaunchDescription(const lmo::Value& file);
 
 class ServiceManager {
  public:
@@ -45,28 +128,53 @@ class ServiceManager {
   // an empty table. A file that cannot be read or does not have the form
   // above is an empty table and one log line (the next change replaces it).
   // Registrations whose host process no longer exists are dropped while
-  // loading, and the file rewritten without them.
+  // loading (with their launch descriptions), and the file rewritten without
+  // them; the hosts still alive are watched from then on and their launch
+  // descriptions written again.
   explicit ServiceManager(std::string directory);
-  // Runs the removals already submitted (their replies are still posted).
-  ~ServiceManager() = default;
+  // Stops watching hosts, then runs the removals already submitted (their
+  // replies are still posted). Registrations and files stay.
+  ~ServiceManager();
   ServiceManager(const ServiceManager&) = delete;
   ServiceManager& operator=(const ServiceManager&) = delete;
 
   const std::string& path() const { return path_; }
+  const std::string& directory() const { return directory_; }
 
-  // Adds a registration, replacing one for the same bundle identifier,
-  // version and host pid, and persists the table. Synchronous. Errors (the
-  // table and file unchanged): domain "POSIX", code EINVAL for an empty
-  // bundle identifier, a pid that is not positive or an executable path that
-  // is not absolute; ENOSPC when the table is full; the write's error
-  // (domain "POSIX" or "PropertyList") when the file cannot be replaced.
-  base::Result<void> registerExternalService(ExternalServiceRegistration registration);
+  // Adds a registration for the live process registration.hostPid, named
+  // also by hostPidfd (borrowed: the manager keeps a duplicate of its own),
+  // replacing one for the same bundle identifier, version and host pid;
+  // publishes the launch description and persists the table. Synchronous.
+  // Two versions of one bundle identifier for one host share one launch
+  // description file: it describes the one registered last.
+  //
+  // Every error is in domain "POSIX" with the errno as its code (the error
+  // number the enabling step reports), and leaves the table and files as they
+  // were:
+  //   EINVAL  an empty bundle identifier or one that cannot be a file name
+  //           (a '/', too long), a pid that is not positive, an executable
+  //           path that is not absolute, a malformed description (see
+  //           encodeLaunchDescription), or a description with no property-list
+  //           form;
+  //   ESRCH   the host has exited, or hostPidfd does not stand for it;
+  //   ENOENT  no executable at the path (or another error of stat(2) on it);
+  //   EACCES  the executable is not a regular file with an execute bit;
+  //   E2BIG   too many environment variables, or a launch description larger
+  //           than kMaxLaunchDescriptionBytes;
+  //   ENOSPC  the table is full;
+  //   EEXIST  a stale directory of an exited host with the same pid could not
+  //           be cleared;
+  //   the errno of a failed write (EIO when the failure had none).
+  base::Result<void> registerExternalService(ExternalServiceRegistration registration,
+                                             int hostPidfd);
 
   // Removes every registration of bundleIdentifier and version (whatever the
-  // host pid) on the service manager's own queue, then posts reply(result)
-  // to replyQueue: 0 when at least one was removed, ESRCH when none matched,
-  // or the errno of a failed write of the file (the table is then unchanged).
-  // Returns at once. replyQueue must outlive the reply.
+  // host pid) and their launch descriptions on the service manager's own
+  // queue, then posts reply(result) to replyQueue: 0 when at least one was
+  // removed, ESRCH when none matched, or the errno of a failed write of the
+  // table (the table and files are then unchanged). A launch description
+  // that cannot be removed after the table was written is logged. Returns at
+  // once. replyQueue must outlive the reply.
   void removeExternalService(std::string bundleIdentifier, std::string version,
                              base::SerialQueue& replyQueue, std::function<void(int)> reply);
 
@@ -74,17 +182,37 @@ class ServiceManager {
   std::vector<ExternalServiceRegistration> registrations();
 
  private:
+  struct Host;
+  class HostWatcher;
+  using HostPtr = std::shared_ptr<const Host>;
+  using Table = std::vector<ExternalServiceRegistration>;
+
   void load();
+  void adoptLoadedHosts(Table& table);
   // Replaces the file with table. Requires the queue (or the constructor).
-  base::Result<void> persist(const std::vector<ExternalServiceRegistration>& table);
+  base::Result<void> persist(const Table& table);
+  base::Result<void> registerOnQueue(const ExternalServiceRegistration& registration,
+                                     const HostPtr& candidate);
   int removeNow(const std::string& bundleIdentifier, const std::string& version);
+  void hostExited(const HostPtr& host);
+  // Makes the launch description of (pid, bundleIdentifier) show the last
+  // matching registration of table, or removes it when there is none.
+  base::Result<void> publish(const Table& table, pid_t pid, const std::string& bundleIdentifier);
+  base::Result<void> createHostDirectory(const Host& host);
+  void dropHost(pid_t pid);
 
   // Constant after construction.
   const std::string directory_;
   const std::string path_;
 
   // Owned by queue_ (filled by the constructor before any block runs).
-  std::vector<ExternalServiceRegistration> table_;
+  Table table_;
+  // Owned by queue_: the hosts that have registrations, each watched.
+  std::map<pid_t, HostPtr> hosts_;
+
+  // Has its own thread and lock. Stopped by the destructor before queue_
+  // drains, destroyed after it.
+  std::unique_ptr<HostWatcher> watcher_;
 
   // Declared last so that it is destroyed first: its destructor runs the
   // removals still queued while table_ is alive.

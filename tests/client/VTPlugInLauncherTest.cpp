@@ -1,0 +1,231 @@
+#include "client/VTPlugInLauncher.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <linux/landlock.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/AtomicFile.h"
+#include "platform/ServiceManager.h"
+#include "tests/support/PeerProcess.h"
+#include "tests/support/TempDir.h"
+
+namespace vantrel::client {
+namespace {
+
+namespace fs = std::filesystem;
+
+bool landlockAvailable() {
+  return ::syscall(SYS_landlock_create_ruleset, nullptr, 0, LANDLOCK_CREATE_RULESET_VERSION) >= 0;
+}
+
+// The lines a finished child wrote to fd, which is then closed.
+std::vector<std::string> readLines(int fd) {
+  std::string text;
+  char buffer[4096];
+  for (ssize_t n; (n = ::read(fd, buffer, sizeof buffer)) != 0;) {
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) break;
+    text.append(buffer, static_cast<size_t>(n));
+  }
+  ::close(fd);
+  std::vector<std::string> lines;
+  for (size_t at = 0, end; (end = text.find('\n', at)) != std::string::npos; at = end + 1) {
+    lines.push_back(text.substr(at, end - at));
+  }
+  return lines;
+}
+
+// Points the runtime directory at a temporary one while a test runs, with a
+// service manager over it that can enable plug-ins for this process.
+class VTPlugInLauncherTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (const char* previous = std::getenv(kVariable)) previous_ = previous;
+    ::setenv(kVariable, runtime_.path().c_str(), 1);
+    manager_ = std::make_unique<platform::ServiceManager>(runtime_.path().string());
+    selfPidfd_ = static_cast<int>(::syscall(SYS_pidfd_open, ::getpid(), 0));
+  }
+  void TearDown() override {
+    manager_.reset();
+    ::close(selfPidfd_);
+    if (previous_) {
+      ::setenv(kVariable, previous_->c_str(), 1);
+    } else {
+      ::unsetenv(kVariable);
+    }
+  }
+
+  base::Result<void> enable(const char* id, lmo::Dictionary environment, const char* profile,
+                            std::string executable = VANTREL_ENV_REPORTER_PATH, pid_t host = 0,
+                            int hostPidfd = -1) {
+    const lmo::Dictionary service{{"EnvironmentVariables", std::move(environment)},
+                                  {"_SandboxProfile", profile}};
+    return manager_->registerExternalService(
+        {id, "1", host != 0 ? host : ::getpid(), std::move(executable),
+         lmo::Dictionary{{"LMOService", service}}},
+        host != 0 ? hostPidfd : selfPidfd_);
+  }
+
+  std::string descriptionPath(const char* id) const {
+    return platform::launchDescriptionPath(runtime_.path().string(), ::getpid(), id);
+  }
+
+  // Launches id with its output on a pipe and returns what it wrote.
+  std::vector<std::string> run(const char* id, std::vector<std::string> arguments) {
+    int out[2];
+    if (::pipe2(out, O_CLOEXEC) != 0) return {"(no pipe)"};
+    base::Result<pid_t> pid =
+        VTPlugInLauncher::launch(id, {.arguments = std::move(arguments), .standardOutput = out[1]});
+    ::close(out[1]);
+    if (!pid.has_value()) {
+      ::close(out[0]);
+      return {pid.error().description()};
+    }
+    std::vector<std::string> lines = readLines(out[0]);
+    int status = 0;
+    ::waitpid(pid.value(), &status, 0);
+    if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) lines.push_back("(failed)");
+    return lines;
+  }
+
+  static constexpr const char* kVariable = "VANTREL_RUNTIME_DIR";
+  testing::TempDir runtime_;
+  testing::TempDir files_;
+  std::unique_ptr<platform::ServiceManager> manager_;
+  std::optional<std::string> previous_;
+  int selfPidfd_ = -1;
+};
+
+TEST_F(VTPlugInLauncherTest, StartsThePlugInExactlyAsDescribed) {
+  const bool confined = landlockAvailable();
+  struct Case {
+    const char* profile;
+    bool outsideWritable;
+  };
+  for (const Case& c : {Case{"plugin", !confined}, Case{"keyboard", true}}) {
+    SCOPED_TRACE(c.profile);
+    const std::string container = files_.file(std::string("container-") + c.profile);
+    fs::create_directories(container);
+    const std::string outside = files_.file(std::string("outside-") + c.profile);
+    const std::string inside = container + "/inside";
+    ASSERT_TRUE(enable("com.example.reporter",
+                       lmo::Dictionary{{"HOME", container},
+                                       {"TMPDIR", container + "/tmp"},
+                                       {"GREETING", "hello world"}},
+                       c.profile)
+                    .has_value());
+
+    const std::vector<std::string> lines =
+        run("com.example.reporter", {"write", outside, "write", inside});
+    std::vector<std::string> environment;
+    for (const std::string& line : lines) {
+      if (line.rfind("env ", 0) == 0) environment.push_back(line.substr(4));
+    }
+    std::sort(environment.begin(), environment.end());
+    // Exactly the description's variables: nothing of this process's own.
+    EXPECT_EQ(environment, (std::vector<std::string>{"GREETING=hello world", "HOME=" + container,
+                                                     "TMPDIR=" + container + "/tmp"}));
+    const std::vector<std::string> expected{
+        "cwd " + container,
+        "nnp 1",
+        "write " + outside + (c.outsideWritable ? " ok" : " 13"),
+        "write " + inside + " ok",
+        "end",
+    };
+    EXPECT_EQ(std::vector<std::string>(lines.begin() + static_cast<long>(environment.size()),
+                                       lines.end()),
+              expected);
+  }
+}
+
+TEST_F(VTPlugInLauncherTest, RefusesWhatItCannotStartAndLeavesNoChildBehind) {
+  const std::string copied = files_.file("copied-reporter");
+  fs::copy_file(VANTREL_ENV_REPORTER_PATH, copied);
+  const std::string container = files_.file("container");
+  fs::create_directories(container);
+  std::unique_ptr<testing::PeerProcess> other =
+      testing::PeerProcess::start(testing::testPeerPath(), {"sleep"});
+  ASSERT_TRUE(other && other->readLine() == "ready");
+
+  struct Case {
+    const char* name;
+    std::function<void()> prepare;
+    const char* id;
+    int standardOutput;
+    const char* domain;
+    int64_t code;
+  };
+  const Case cases[] = {
+      {"never enabled", [] {}, "com.example.absent", -1, kPlugInLauncherErrorDomain,
+       kLaunchNotEnabled},
+      {"enabled for another process",
+       [&] {
+         ASSERT_TRUE(
+             enable("com.example.theirs", {}, "plugin", copied, other->pid(), other->pidfd())
+                 .has_value());
+       },
+       "com.example.theirs", -1, kPlugInLauncherErrorDomain, kLaunchNotEnabled},
+      {"not a file name", [] {}, "a/b", -1, platform::kPosixErrorDomain, EINVAL},
+      {"writable by the group",
+       [&] {
+         ASSERT_TRUE(enable("com.example.gw", {}, "plugin").has_value());
+         fs::permissions(descriptionPath("com.example.gw"), fs::perms::group_write,
+                         fs::perm_options::add);
+       },
+       "com.example.gw", -1, kPlugInLauncherErrorDomain, kLaunchUntrustedDescription},
+      {"not a property list",
+       [&] {
+         ASSERT_TRUE(enable("com.example.bad", {}, "plugin").has_value());
+         ASSERT_TRUE(
+             platform::writeFileAtomically(descriptionPath("com.example.bad"), "<plist", 0600)
+                 .has_value());
+       },
+       "com.example.bad", -1, kPlugInLauncherErrorDomain, kLaunchMalformedDescription},
+      {"executable gone",
+       [&] {
+         ASSERT_TRUE(
+             enable("com.example.gone", lmo::Dictionary{{"HOME", container}}, "plugin", copied)
+                 .has_value());
+         fs::remove(copied);
+       },
+       "com.example.gone", -1, platform::kPosixErrorDomain, ENOENT},
+      {"working directory gone",
+       [&] {
+         ASSERT_TRUE(enable("com.example.nowhere", lmo::Dictionary{{"HOME", container + "/none"}},
+                            "keyboard")
+                         .has_value());
+       },
+       "com.example.nowhere", -1, platform::kPosixErrorDomain, ENOENT},
+      {"closed output", [&] { ASSERT_TRUE(enable("com.example.out", {}, "plugin").has_value()); },
+       "com.example.out", 1000, platform::kPosixErrorDomain, EBADF},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    c.prepare();
+    base::Result<pid_t> pid = VTPlugInLauncher::launch(c.id, {.standardOutput = c.standardOutput});
+    ASSERT_FALSE(pid.has_value());
+    EXPECT_EQ(pid.error().domain, c.domain);
+    EXPECT_EQ(pid.error().code, c.code) << pid.error().description();
+    // A child that failed before its exec has been reaped: none is waiting.
+    EXPECT_EQ(::waitpid(-1, nullptr, WNOHANG), 0);
+  }
+  EXPECT_EQ(VTPlugInLauncher::launch("com.example.absent").error().description(),
+            "no launch description for com.example.absent (not enabled for this process)");
+}
+
+}  // namespace
+}  // namespace vantrel::client
