@@ -298,8 +298,9 @@ base::Result<lmo::Value> encodeLaunchDescription(const ExternalServiceRegistrati
       {kLaunchHostPidKey, lmo::Value::integer(registration.hostPid)},
       {kLaunchServiceKey, service},
   };
-  const std::string* home = environmentOf(service).get(kLaunchHomeVariable).getIfString();
-  if (isAbsolutePath(home)) file = file.setting(kLaunchWorkingDirectoryKey, *home);
+  const std::string* container =
+      registration.dataContainer ? &*registration.dataContainer : nullptr;
+  if (isAbsolutePath(container)) file = file.setting(kLaunchWorkingDirectoryKey, *container);
   return lmo::Value(file);
 }
 

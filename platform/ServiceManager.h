@@ -72,8 +72,6 @@ inline constexpr const char* kLaunchWorkingDirectoryKey = "workingDirectory";
 inline constexpr const char* kLaunchServiceKey = "LMOService";
 inline constexpr const char* kLaunchEnvironmentKey = "EnvironmentVariables";
 inline constexpr const char* kLaunchSandboxProfileKey = "_SandboxProfile";
-// The environment variable whose value becomes the working directory.
-inline constexpr const char* kLaunchHomeVariable = "HOME";
 // The profile assumed when a description names none: the confining one.
 inline constexpr const char* kDefaultSandboxProfile = "plugin";
 
@@ -83,6 +81,10 @@ struct ExternalServiceRegistration {
   pid_t hostPid = 0;
   std::string executablePath;
   lmo::Dictionary description;  // the launch description the plug-in runs with
+  // The plug-in's data container: its working directory and, under the
+  // "plugin" profile, the only place it may write. Never taken from the
+  // environment, which a bundle can set itself. nullopt: none.
+  std::optional<std::string> dataContainer;
   bool operator==(const ExternalServiceRegistration&) const = default;
 };
 
@@ -97,7 +99,7 @@ struct LaunchDescription {
   // environment and are left out.
   std::vector<std::string> environment;
   std::string sandboxProfile;
-  // Absolute; nullopt when the environment has no absolute "HOME".
+  // The registration's data container; nullopt when it had none.
   std::optional<std::string> workingDirectory;
 };
 

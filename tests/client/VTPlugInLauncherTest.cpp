@@ -74,10 +74,18 @@ class VTPlugInLauncherTest : public ::testing::Test {
                             int hostPidfd = -1) {
     const lmo::Dictionary service{{"EnvironmentVariables", std::move(environment)},
                                   {"_SandboxProfile", profile}};
-    return manager_->registerExternalService(
-        {id, "1", host != 0 ? host : ::getpid(), std::move(executable),
-         lmo::Dictionary{{"LMOService", service}}},
-        host != 0 ? hostPidfd : selfPidfd_);
+    // The tests' data container is what they set as HOME.
+    platform::ExternalServiceRegistration registration{
+        id, "1", host != 0 ? host : ::getpid(), std::move(executable),
+        lmo::Dictionary{{"LMOService", service}}};
+    if (const std::string* home = service.get("EnvironmentVariables")
+                                      .getIfDictionary()
+                                      ->get("HOME")
+                                      .getIfString()) {
+      registration.dataContainer = *home;
+    }
+    return manager_->registerExternalService(std::move(registration),
+                                             host != 0 ? hostPidfd : selfPidfd_);
   }
 
   std::string descriptionPath(const char* id) const {

@@ -172,11 +172,12 @@ TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
   ExternalServiceRegistration r = f.service("com.example.p", "1.0", host);
   r.description = r.description.setting(
       "LMOService",
-      lmo::Dictionary{{"EnvironmentVariables", lmo::Dictionary{{"HOME", "/data/p"},
+      lmo::Dictionary{{"EnvironmentVariables", lmo::Dictionary{{"HOME", "/home/elsewhere"},
                                                                {"LANG", "C"},
                                                                {"COUNT", lmo::Value::integer(3)},
                                                                {"A=B", "x"}}},
                       {"_SandboxProfile", "keyboard"}});
+  r.dataContainer = "/data/p";
   ASSERT_TRUE(manager.registerExternalService(r, host.pidfd()).has_value());
 
   const std::string file = f.launchFile(host, "com.example.p");
@@ -196,8 +197,9 @@ TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
   EXPECT_EQ(d.hostPid, host.pid());
   EXPECT_EQ(d.executablePath, f.executable);
   // A number and a name holding '=' cannot be environment entries.
-  EXPECT_EQ(d.environment, (std::vector<std::string>{"HOME=/data/p", "LANG=C"}));
+  EXPECT_EQ(d.environment, (std::vector<std::string>{"HOME=/home/elsewhere", "LANG=C"}));
   EXPECT_EQ(d.sandboxProfile, "keyboard");
+  // The container, not whatever the environment claims as home.
   EXPECT_EQ(d.workingDirectory, "/data/p");
 }
 
