@@ -25,12 +25,12 @@ struct Operation {
   void (Transaction::*run)();
 };
 
-// Looked up in this order, byte for byte. "match", "ready" and "access" are
-// not served yet, so they are "unrecognized request" like any unknown type.
+// Looked up in this order, byte for byte.
 constexpr Operation kDispatchTable[] = {
-    {"add", &Transaction::addPlugIns},       {"remove", &Transaction::removePlugIns},
-    {"bulk", &Transaction::bulkPlugIns},     {"annotate", &Transaction::annotatePlugIns},
-    {"lock", &Transaction::lockDownPlugIns},
+    {"add", &Transaction::addPlugIns},           {"remove", &Transaction::removePlugIns},
+    {"bulk", &Transaction::bulkPlugIns},         {"match", &Transaction::matchPlugIns},
+    {"ready", &Transaction::readyPlugIns},       {"access", &Transaction::accessPlugIns},
+    {"annotate", &Transaction::annotatePlugIns}, {"lock", &Transaction::lockDownPlugIns},
 };
 
 // The canonical form of an absolute path, or nullopt when it does not exist,

@@ -25,6 +25,7 @@ namespace vantrel::daemon {
 
 class VTDLmoClient;
 class VTDServer;
+struct MatchState;
 
 // The protocol version this daemon speaks, and the oldest it still serves.
 inline constexpr uint64_t kCurrentProtocolVersion = 3;
@@ -67,8 +68,15 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void addPlugIns();
   void removePlugIns();
   void bulkPlugIns();
+  void matchPlugIns();
+  void readyPlugIns();
+  void accessPlugIns();
   void annotatePlugIns();
   void lockDownPlugIns();
+
+  // Sets the form's "annotations" to the plug-in's annotation (empty when
+  // it has none).
+  void addAnnotationForPlugIn(const registry::VTDPlugIn& plugIn, lmo::Dictionary& in);
 
   // ---- Accessors ----
   const std::shared_ptr<VTDLmoClient>& client() const { return client_; }
@@ -82,6 +90,12 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   std::shared_ptr<lmo::Connection> connection() const;
 
  private:
+  // The match request's candidate steps.
+  void visitCandidate(const registry::VTDPlugIn& plugIn, MatchState& state,
+                      const std::optional<lmo::Dictionary>& rules);
+  bool keepCandidate(const registry::VTDPlugIn& plugIn, uint64_t flags,
+                     const lmo::Array& exclusions, const std::optional<lmo::Dictionary>& rules);
+
   Transaction(lmo::IncomingMessage request, std::shared_ptr<VTDLmoClient> client);
 
   // Constant after construction.

@@ -5,9 +5,12 @@
 // of the bundle's Info dictionary is copied at construction and every reader
 // sees the registry's current snapshot of the plug-in.
 
+#include <atomic>
+#include <climits>
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 
@@ -16,6 +19,7 @@
 #include "model/VTPlugInCore.h"
 #include "omnidex/Records.h"
 #include "omnidex/Workspace.h"
+#include "registry/VTDHost.h"
 
 namespace vantrel::registry {
 
@@ -114,6 +118,37 @@ class VTDPlugIn : public model::VTPlugInCore {
   // database that builds the record, before it is shared.
   void setDatabase(std::weak_ptr<VTDatabase> database) { database_ = std::move(database); }
 
+  // ---- Host authorisation ----
+  // Called on the service queue. Nothing here fails: missing files, keys or
+  // services mean no restriction.
+
+  // Null when host may use the plug-in, else why not: the host's own
+  // allowed-plug-ins restriction, the entitlement the plug-in demands of its
+  // hosts, then the device's rating limit on the containing application.
+  std::optional<std::string> allowForClient(const VTDHost& host) const;
+  // The containing application's rating is above the device's limit (read
+  // afresh on every call).
+  bool ageRestricted() const;
+  // The containing application's rating from its bundle container's
+  // metadata file, read once per record; -1 when unknown.
+  int64_t containerAgeRestriction() const;
+  // The privacy-consent services granted to the containing application.
+  std::set<std::string> allowedVGLServices() const;
+
+  // ---- Access and enabling ----
+
+  // A read token per resource path (a string or an array of strings,
+  // relative to the bundle; "." is the bundle itself). Resources that get
+  // no token are left out, with a log line.
+  lmo::Dictionary issueResourceExtensions(const lmo::Value& resources) const;
+  // Adds "extensions" to a form: tokens for the bundle of an application
+  // extension, or for the resources its "Shared" key lists.
+  void augmentForm(lmo::Dictionary& form) const;
+  // Registers the plug-in as an external service that the host process pid
+  // (named for certain by hostPidfd) may launch, with its environment and
+  // sandbox profile. Null on success, else a code 4 error.
+  std::optional<base::Error> enableForPid(pid_t pid, int hostPidfd) const;
+
   // ---- Busy check ----
 
   // Null when no instance of the plug-in runs; otherwise a conflict entry
@@ -138,8 +173,13 @@ class VTDPlugIn : public model::VTPlugInCore {
   // which is stored unless a setter got there first.
   std::optional<std::string> lazyName(std::optional<std::string>& field, NameFetch fetch) const;
 
-  omnidex::PlugInRecordPtr oxproxy_;  // Constant once the record is shared.
+  omnidex::PlugInRecordPtr oxproxy_;    // Constant once the record is shared.
   std::weak_ptr<VTDatabase> database_;  // Constant once the record is shared.
+
+  // The containing application's rating: kRatingNotRead until first read.
+  // Atomic so that a racing first read costs a second file read, no more.
+  static constexpr int64_t kRatingNotRead = INT64_MIN;
+  mutable std::atomic<int64_t> containerAgeRestriction_{kRatingNotRead};
 
   // Guards the three names below: a first read stores what it fetched while
   // other threads may read or set the same field.

@@ -38,7 +38,7 @@ TEST_F(RequestProtocol, EnvelopeIsCheckedBeforeDispatch) {
       {{{"request", u64(1)}, {"version", u64(3)}}, {4, "invalid request format (missing type)"}},
       {{{"request", "ADD"}, {"version", u64(3)}}, {4, "unrecognized request"}},
       {{{"request", "frobnicate"}, {"version", u64(2)}}, {4, "unrecognized request"}},
-      {{{"request", "match"}, {"version", u64(3)}}, {4, "unrecognized request"}},
+      {{{"request", "Match"}, {"version", u64(3)}}, {4, "unrecognized request"}},
       {{{"request", "bulk"}, {"version", u64(2)}}, {0, ""}},
       {{{"request", "bulk"}, {"version", u64(3)}, {"flags", u64(0x1F)}}, {0, ""}},
   };
