@@ -297,6 +297,9 @@ void Connection::readAvailable() {
       }
       if (!handleFrame(std::move(*frame).value())) return;
     }
+    // The socket is drained: epoll is level-triggered, so anything that
+    // arrives now wakes us again, and a second recv would only say EAGAIN.
+    if (static_cast<size_t>(n) < sizeof buffer) return;
   }
 }
 
