@@ -20,11 +20,14 @@
 #include "platform/AtomicFile.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
+#include "platform/ScopedFd.h"
 #include "platform/ServiceManager.h"
 #include "platform/TrustedFile.h"
 
 namespace vantrel::client {
 namespace {
+
+using platform::ScopedFd;
 
 constexpr const char* kRootDirectory = "/";
 // Writable under the "plugin" profile wherever the data container is: so
@@ -82,23 +85,6 @@ const char* stepName(int step) {
 struct ChildFailure {
   int step = 0;
   int error = 0;
-};
-
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd = -1) : fd_(fd) {}
-  ~ScopedFd() { reset(); }
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  int get() const { return fd_; }
-  int release() { return std::exchange(fd_, -1); }
-  void reset(int fd = -1) {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = fd;
-  }
-
- private:
-  int fd_;
 };
 
 base::Error systemError(int err, std::string_view what) {

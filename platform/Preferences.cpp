@@ -14,6 +14,7 @@
 #include "platform/FileLock.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
+#include "platform/ScopedFd.h"
 
 namespace vantrel::platform {
 namespace {
@@ -21,21 +22,6 @@ namespace {
 constexpr mode_t kDirectoryMode = 0700;
 constexpr mode_t kFileMode = 0600;
 constexpr const char* kFallbackHostName = "localhost";
-
-// Closes a descriptor when it goes out of scope.
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ~ScopedFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 // Reads at most limit + 1 bytes, so that a file that grew past the limit
 // after it was measured is still caught. Returns 0 or errno.

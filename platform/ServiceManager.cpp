@@ -23,6 +23,7 @@
 #include "platform/Paths.h"
 #include "platform/ProcessInfo.h"
 #include "platform/PropertyList.h"
+#include "platform/ScopedFd.h"
 #include "platform/SmallFile.h"
 
 namespace vantrel::platform {
@@ -51,21 +52,6 @@ constexpr const char* kDescriptionKey = "description";
 
 constexpr std::string_view kUidField = "Uid:";
 constexpr std::string_view kGidField = "Gid:";
-
-// Closes a descriptor on every path out of a scope.
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ~ScopedFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  int get() const { return fd_; }
-
- private:
-  int fd_;
-};
 
 bool isSameService(const ExternalServiceRegistration& a, const ExternalServiceRegistration& b) {
   return a.bundleIdentifier == b.bundleIdentifier && a.version == b.version &&
