@@ -170,8 +170,9 @@ void Transaction::matchPlugIns() {
   }
   // Read once per request: another process may rewrite the preferences
   // between two requests, never within one.
-  if (const lmo::Array* exclusions = server()->userPrefs()->exclusions().getIfArray()) {
-    state.exclusions = *exclusions;
+  const lmo::Value exclusions = server()->userPrefs()->exclusions();
+  if (const lmo::Array* list = exclusions.getIfArray()) {
+    state.exclusions = *list;
   }
   std::optional<registry::VTDatabase::PlugInList> candidates = server()->findPlugIns(rules);
   probes::discoverRaw(candidates ? static_cast<unsigned>(candidates->size()) : 0u);

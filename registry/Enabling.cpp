@@ -2,6 +2,9 @@
 // plug-in registered as a service the host's process may launch, with its
 // environment and sandbox profile.
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -21,6 +24,11 @@ constexpr std::string_view kExtensionPointKey = "QXExtensionPointIdentifier";
 constexpr std::string_view kServiceKey = "LMOService";
 constexpr std::string_view kEnvironmentKey = "EnvironmentVariables";
 constexpr const char* kTestSdkVariable = "VTTEST_SDK";
+
+bool isExecutableFile(const std::string& path) {
+  struct stat st {};
+  return ::stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && ::access(path.c_str(), X_OK) == 0;
+}
 
 // The sandbox profile of a plug-in, by its extension point.
 const char* sandboxProfileFor(const VTDPlugIn& plugIn) {
@@ -91,7 +99,8 @@ std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) con
     environment = environment.setting(kTestSdkVariable, sdk);
   }
   lmo::Dictionary service;
-  if (const lmo::Dictionary* declared = infoKey(kServiceKey).getIfDictionary()) service = *declared;
+  const lmo::Value declared = infoKey(kServiceKey);
+  if (const lmo::Dictionary* entries = declared.getIfDictionary()) service = *entries;
   // Entries that are not a dictionary cannot be merged and are left out.
   if (const lmo::Dictionary* own = service.get(kEnvironmentKey).getIfDictionary()) {
     for (const auto& [name, value] : *own) environment = environment.setting(name, value);
@@ -106,8 +115,10 @@ std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) con
               path());
 
   auto bundle = url() ? model::VTBundle::initWithURL(*url()) : nullptr;
+  // The bundle service answers the bundle's own path when it names no
+  // executable: only a regular, executable file will do.
   const std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
-  if (!executable) {
+  if (!executable || !isExecutableFile(*executable)) {
     return base::error_with_code_and_format(base::kErrorBadRequest,
                                             "cannot obtain executable path for plug-in %@(%@)",
                                             identifier(), uuidText);

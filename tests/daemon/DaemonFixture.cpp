@@ -6,6 +6,7 @@
 #include <thread>
 
 #include "platform/PropertyList.h"
+#include "platform/ServiceManager.h"
 #include "tests/omnidex/OmnidexFixtures.h"
 #include "tests/support/PeerProcess.h"
 
@@ -14,8 +15,10 @@ namespace vantrel::daemon::testing {
 using namespace std::chrono_literals;
 
 void DaemonTest::SetUp() {
-  for (const char* name : {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME",
-                           "VANTREL_PREFERENCES_DIR"}) {
+  // Bound while the runtime directory is not yet this test's own.
+  serviceManagerDirectory();
+  for (const char* name :
+       {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME", "VANTREL_PREFERENCES_DIR"}) {
     const char* value = std::getenv(name);
     savedEnvironment_[name] = value ? std::optional<std::string>(value) : std::nullopt;
   }
@@ -70,7 +73,8 @@ lmo::Dictionary DaemonTest::plugInInfo(const std::string& identifier) {
 }
 
 std::string DaemonTest::writePlugIn(const std::string& relative, const std::string& identifier) {
-  const std::string path = omnidex::testing::writeBundle(tmp_.file(relative), plugInInfo(identifier));
+  const std::string path =
+      omnidex::testing::writeBundle(tmp_.file(relative), plugInInfo(identifier));
   EXPECT_TRUE(vantrel::testing::installTestPeer(path + "/peer"));
   return path;
 }
@@ -89,8 +93,8 @@ std::shared_ptr<lmo::Connection> DaemonTest::connect() {
   return connection;
 }
 
-std::optional<lmo::Dictionary> DaemonTest::send(const lmo::Dictionary& message,
-                                                const std::shared_ptr<lmo::Connection>& connection) {
+std::optional<lmo::Dictionary> DaemonTest::send(
+    const lmo::Dictionary& message, const std::shared_ptr<lmo::Connection>& connection) {
   auto peer = connection ? connection : connect();
   auto promise = std::make_shared<std::promise<std::optional<lmo::Dictionary>>>();
   auto reply = promise->get_future();
@@ -110,9 +114,24 @@ std::optional<lmo::Dictionary> DaemonTest::send(const lmo::Dictionary& message,
 
 lmo::Dictionary DaemonTest::request(const char* type, lmo::Dictionary extras,
                                     const std::shared_ptr<lmo::Connection>& connection) {
-  lmo::Dictionary message = extras.setting("request", type)
-                                .setting("version", lmo::Value::unsignedInteger(3));
-  return send(message, connection).value_or(lmo::Dictionary{{"no reply", lmo::Value::boolean(true)}});
+  lmo::Dictionary message =
+      extras.setting("request", type).setting("version", lmo::Value::unsignedInteger(3));
+  return send(message, connection)
+      .value_or(lmo::Dictionary{{"no reply", lmo::Value::boolean(true)}});
+}
+
+const std::string& DaemonTest::serviceManagerDirectory() {
+  static vantrel::testing::TempDir directory;
+  static const std::string bound = [] {
+    const char* saved = std::getenv("VANTREL_RUNTIME_DIR");
+    const std::optional<std::string> previous = saved ? std::optional(saved) : std::nullopt;
+    ::setenv("VANTREL_RUNTIME_DIR", directory.path().c_str(), 1);
+    std::string used = platform::ServiceManager::shared().directory();
+    previous ? ::setenv("VANTREL_RUNTIME_DIR", previous->c_str(), 1)
+             : ::unsetenv("VANTREL_RUNTIME_DIR");
+    return used;
+  }();
+  return bound;
 }
 
 bool DaemonTest::eventually(const std::function<bool()>& condition) {

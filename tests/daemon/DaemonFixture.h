@@ -50,6 +50,11 @@ class DaemonTest : public ::testing::Test {
   // {"request": type, "version": 3} plus extras, sent and answered.
   lmo::Dictionary request(const char* type, lmo::Dictionary extras = {},
                           const std::shared_ptr<lmo::Connection>& connection = nullptr);
+  // The directory of platform::ServiceManager::shared() (launch descriptions
+  // go under it): one for the whole test process, since the manager binds to
+  // the runtime directory at its first use while every test has a runtime
+  // directory of its own. Bound at the first set-up.
+  static const std::string& serviceManagerDirectory();
   // Polls until condition holds or five seconds pass; whether it held.
   static bool eventually(const std::function<bool()>& condition);
 

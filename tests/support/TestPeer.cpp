@@ -17,7 +17,15 @@
 //              "held <token>\n" when granted or "error <code> <message>\n"
 //              when refused, then blocks until standard input closes (the
 //              hold lasts as long as the connection); exit 0.
-// In the last two modes a connection that fails or a daemon that does not
+//   request <service> <type> <flags> [<uuid>...]
+//              sends {"request": type, "version": 3, "flags": flags,
+//              "uuids": [<uuid>...]} and writes the answer as one line:
+//              "ok", followed for a reply with "matches" by " <count>
+//              <identifier>,<identifier>..." in reply order, or
+//              "error <code> <message>"; then blocks until standard input
+//              closes (what the request set up for this process, such as an
+//              enabled plug-in, lasts as long as it runs); exit 0.
+// In the last three modes a connection that fails or a daemon that does not
 // answer within 30 s gives "error <code> <message>\n" and exit 1. Log lines go
 // to standard error. Anything else: a usage line on standard error, exit 2.
 //
@@ -116,6 +124,48 @@ int holdAndWait(const char* service, uint64_t flags, std::vector<std::string> pa
   return blockUntilStdinCloses();
 }
 
+// "ok", with the identifiers of the forms in a match reply's "matches".
+std::string describeSuccess(const vantrel::lmo::Dictionary& reply) {
+  const vantrel::lmo::Array* forms = reply.get("matches").getIfArray();
+  if (forms == nullptr) return "ok";
+  std::string identifiers;
+  for (const vantrel::lmo::Value& form : *forms) {
+    const vantrel::lmo::Dictionary* fields = form.getIfDictionary();
+    const std::string* identifier = fields ? fields->get("identifier").getIfString() : nullptr;
+    if (!identifiers.empty()) identifiers += ',';
+    identifiers += identifier ? *identifier : "?";
+  }
+  return vantrel::base::format("ok %u %s", static_cast<unsigned>(forms->size()), identifiers);
+}
+
+int requestAndWait(const char* service, const char* type, uint64_t flags,
+                   const std::vector<vantrel::base::Uuid>& uuids) {
+  auto client = VTDaemonClient::initWithServiceName(service);
+  const auto message = VTDaemonClient::set(client->request(type), uuids)
+                           .setting("flags", vantrel::lmo::Value::unsignedInteger(flags));
+  auto outcome = client->sendSync(message, kReplyTimeout);
+  if (auto failure = transportFailure(outcome)) {
+    printError(*failure);
+    return kConnectionFailedExit;
+  }
+  if (auto refused = VTDaemonClient::errorInReply(outcome.value())) {
+    printError(*refused);
+  } else {
+    printLine(describeSuccess(outcome.value().message()->body()));
+  }
+  return blockUntilStdinCloses();
+}
+
+std::optional<std::vector<vantrel::base::Uuid>> parseUuids(char** first, char** last) {
+  std::vector<vantrel::base::Uuid> uuids;
+  for (char** arg = first; arg != last; ++arg) {
+    auto uuid = vantrel::base::Uuid::parse(*arg);
+    if (!uuid) return std::nullopt;
+    uuids.push_back(*uuid);
+  }
+  return uuids;
+}
+
 std::optional<uint64_t> parseFlags(const char* text) {
   if (*text < '0' || *text > '9') return std::nullopt;
   char* end = nullptr;
@@ -140,8 +190,14 @@ int main(int argc, char** argv) {
       return holdAndWait(argv[2], *flags, std::vector<std::string>(argv + 4, argv + argc));
     }
   }
+  if (argc >= 5 && mode == "request") {
+    auto flags = parseFlags(argv[4]);
+    auto uuids = parseUuids(argv + 5, argv + argc);
+    if (flags && uuids) return requestAndWait(argv[2], argv[3], *flags, *uuids);
+  }
   std::fprintf(stderr,
-               "usage: %s sleep|print-pid|connect <service>|hold <service> <flags> [<path>...]\n",
+               "usage: %s sleep|print-pid|connect <service>|hold <service> <flags> [<path>...]"
+               "|request <service> <type> <flags> [<uuid>...]\n",
                argc > 0 ? argv[0] : "vantrel-test-peer");
   return kUsageExit;
 }
