@@ -240,6 +240,25 @@ TEST_F(Discovery, HoldsAndExclusionsHide) {
   EXPECT_EQ(matching({}), both);
 }
 
+TEST_F(Discovery, DedicatedPlugInsReachOnlyTheirOwnApplication) {
+  addPlugIn("Owner", "com.ded", {}, {{"Dedicated", Value::boolean(true)}});
+  // The owning application's executable is a test peer.
+  const std::string owner = tmp_.file("apps/Owner.app");
+  omnidex::testing::writeBundle(
+      owner, {{"KBBundleIdentifier", "com.app.Owner"}, {"KBBundleExecutable", "peer"}});
+  ASSERT_TRUE(vantrel::testing::installTestPeer(owner + "/peer"));
+  const std::string stranger = peerWith("Stranger", {{"unrelated", Value::boolean(true)}});
+
+  // This test process has no bundle at all.
+  EXPECT_EQ(matching({{"QXExtensionIdentifier", "com.ded"}}), Ids{});
+  std::string answer;
+  auto own = ask(owner + "/peer", "match", 0, {}, &answer);
+  EXPECT_NE(answer.find("com.ded"), std::string::npos) << answer;
+  auto other = ask(stranger, "match", 0, {}, &answer);
+  EXPECT_TRUE(answer.starts_with("ok ")) << answer;
+  EXPECT_EQ(answer.find("com.ded"), std::string::npos) << answer;
+}
+
 TEST_F(Discovery, DuplicatesResolvedByVersion) {
   addPlugIn("Old", "com.d", {{"QXExtensionVersion", "1.9"}});
   addPlugIn("New", "com.d", {{"QXExtensionVersion", "1.10"}});
