@@ -5,13 +5,11 @@
 
 #include "omnidex/Errors.h"
 #include "omnidex/Limits.h"
+#include "omnidex/Sqlite.h"
 #include "omnidex/Store.h"
 
 namespace vantrel::omnidex {
 namespace {
-
-// SQLite waits this long for the registry's own write transaction.
-constexpr int kBusyTimeoutMs = 5000;
 
 // The table is created here, not with the registry's first tables: a
 // database that predates it must gain it without a version change.
@@ -47,10 +45,6 @@ bool usableIdentifier(std::string_view identifier) {
          identifier.find('\0') == std::string_view::npos;
 }
 
-void bindText(sqlite3_stmt* s, int i, const std::string& text) {
-  sqlite3_bind_text(s, i, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
-}
-
 // Clears a reused statement when the call that used it returns, so that no
 // statement keeps pointers into the caller's strings.
 class StatementUse {
@@ -70,19 +64,8 @@ class StatementUse {
 }  // namespace
 
 base::Result<std::unique_ptr<ConsentStore>> ConsentStore::open(const std::string& path) {
-  sqlite3* db = nullptr;
-  const int rc =
-      sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_FULLMUTEX, nullptr);
-  if (rc != SQLITE_OK) {
-    std::string reason = db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc);
-    sqlite3_close_v2(db);
-    return omnidexError(
-        kOmnidexStoreFailed,
-        base::format("cannot open the privacy-consent table at %@: %@", path, reason));
-  }
+  sqlite3* db = VT_TRY(openConnection(path, SQLITE_OPEN_READWRITE, "the privacy-consent table"));
   std::unique_ptr<ConsentStore> store(new ConsentStore(db, path));
-  sqlite3_extended_result_codes(db, 1);
-  sqlite3_busy_timeout(db, kBusyTimeoutMs);
   VT_TRY(store->prepare());
   return store;
 }

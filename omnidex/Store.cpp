@@ -3,12 +3,10 @@
 #include <utility>
 
 #include "omnidex/Errors.h"
+#include "omnidex/Sqlite.h"
 
 namespace vantrel::omnidex {
 namespace {
-
-// SQLite waits this long for a lock another connection holds.
-constexpr int kBusyTimeoutMs = 5000;
 
 constexpr const char* kCreateSchema = R"sql(
 CREATE TABLE plugins (
@@ -71,10 +69,6 @@ std::optional<std::string> columnBlob(sqlite3_stmt* s, int i) {
   return std::string(static_cast<const char*>(blob), static_cast<size_t>(size));
 }
 
-void bindText(sqlite3_stmt* s, int i, const std::string& text) {
-  sqlite3_bind_text(s, i, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
-}
-
 void bindBlob(sqlite3_stmt* s, int i, const std::string& bytes) {
   // data() is never null, so an empty string binds an empty blob, not NULL.
   sqlite3_bind_blob(s, i, bytes.data(), static_cast<int>(bytes.size()), SQLITE_STATIC);
@@ -83,20 +77,9 @@ void bindBlob(sqlite3_stmt* s, int i, const std::string& bytes) {
 }  // namespace
 
 base::Result<std::unique_ptr<Store>> Store::open(const std::string& path) {
-  sqlite3* db = nullptr;
-  const int rc =
-      sqlite3_open_v2(path.c_str(), &db,
-                      SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX, nullptr);
-  if (rc != SQLITE_OK) {
-    std::string reason = db != nullptr ? sqlite3_errmsg(db) : sqlite3_errstr(rc);
-    sqlite3_close_v2(db);
-    return omnidexError(
-        kOmnidexStoreFailed,
-        base::format("cannot open the application registry at %@: %@", path, reason));
-  }
+  sqlite3* db = VT_TRY(
+      openConnection(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, "the application registry"));
   std::unique_ptr<Store> store(new Store(db, path));
-  sqlite3_extended_result_codes(db, 1);
-  sqlite3_busy_timeout(db, kBusyTimeoutMs);
   VT_TRY(store->prepare());
   return store;
 }

@@ -15,7 +15,6 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-using Expected = std::pair<int64_t, std::string>;
 
 using Annotate = DaemonTest;
 
@@ -49,11 +48,11 @@ TEST_F(Annotate, MalformedChangesTouchNothing) {
 TEST_F(Annotate, StoresTheKnownKeysAndAnnounces) {
   base::LogCapture log;
   const Dictionary settings{{"size", Value::integer(2)}};
-  const Dictionary reply =
-      request("annotate", {{"uuids", Array{uuidOf("widget"), uuidOf("share")}},
-                           {"annotations", Dictionary{{"election", Value::integer(0)},
-                                                      {"extension", settings},
-                                                      {"colour", "red"}}}});
+  const Dictionary reply = request(
+      "annotate",
+      {{"uuids", Array{uuidOf("widget"), uuidOf("share")}},
+       {"annotations",
+        Dictionary{{"election", Value::integer(0)}, {"extension", settings}, {"colour", "red"}}}});
   EXPECT_TRUE(reply.empty()) << lmo::describe(reply);
   const Dictionary stored{{"election", Value::integer(0)}, {"extension", settings}};
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), stored);

@@ -30,15 +30,14 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
   // A peer in a bundle with entitlements, connected to a listener of the
   // test's own whose connections become clients of the server.
   const std::string bundle = tmp_.file("Tools/Manager.app");
-  omnidex::testing::writeBundle(bundle, {{"KBBundleIdentifier", "com.x.manager"},
-                                         {"KBBundleExecutable", "peer"}});
+  omnidex::testing::writeBundle(
+      bundle, {{"KBBundleIdentifier", "com.x.manager"}, {"KBBundleExecutable", "peer"}});
   ASSERT_TRUE(vantrel::testing::installTestPeer(bundle + "/peer"));
-  const Dictionary entitlements{{kManager, Value::boolean(true)},
-                                {"string", "yes"},
-                                {"off", Value::boolean(false)}};
-  ASSERT_TRUE(platform::writePropertyListFile(bundle + "/Entitlements.plist", Value(entitlements),
-                                              0644)
-                  .has_value());
+  const Dictionary entitlements{
+      {kManager, Value::boolean(true)}, {"string", "yes"}, {"off", Value::boolean(false)}};
+  ASSERT_TRUE(
+      platform::writePropertyListFile(bundle + "/Entitlements.plist", Value(entitlements), 0644)
+          .has_value());
 
   auto queue = std::make_shared<base::SerialQueue>("test-listener");
   auto listener = lmo::Listener::create(tmp_.file("peer.socket"), queue);
@@ -48,8 +47,8 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
     accepted->set_value(VTDLmoClient::initWithConnection(c, server_));
   });
   listener.value()->resume();
-  auto peer = vantrel::testing::PeerProcess::start(bundle + "/peer",
-                                                   {"connect", tmp_.file("peer.socket")});
+  auto peer =
+      vantrel::testing::PeerProcess::start(bundle + "/peer", {"connect", tmp_.file("peer.socket")});
   ASSERT_NE(peer, nullptr);
   auto future = accepted->get_future();
   ASSERT_EQ(future.wait_for(10s), std::future_status::ready);

@@ -143,7 +143,7 @@ bool DaemonTest::eventually(const std::function<bool()>& condition) {
   return true;
 }
 
-std::pair<int64_t, std::string> errorOf(const lmo::Dictionary& reply) {
+Expected errorOf(const lmo::Dictionary& reply) {
   const std::string* message = reply.get("error").getIfString();
   return {reply.get("errorcode").integerValue(), message ? *message : ""};
 }

@@ -70,7 +70,13 @@ class DaemonTest : public ::testing::Test {
   std::vector<std::shared_ptr<lmo::Connection>> connections_;
 };
 
-// The error reply's (code, message), or (0, "") for a success.
-std::pair<int64_t, std::string> errorOf(const lmo::Dictionary& reply);
+// An error reply's (code, message); (0, "") for a success.
+using Expected = std::pair<int64_t, std::string>;
+Expected errorOf(const lmo::Dictionary& reply);
+
+// The unsigned integers the protocol's "version" and "flags" are.
+inline lmo::Value u64(uint64_t v) {
+  return lmo::Value::unsignedInteger(v);
+}
 
 }  // namespace vantrel::daemon::testing

@@ -27,17 +27,12 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-using Expected = std::pair<int64_t, std::string>;
 using Ids = std::multiset<std::string>;
 using vantrel::testing::PeerProcess;
 
 constexpr const char* kManager = "com.karvo.private.vantrel.manager";
 constexpr const char* kAllowedPlugIns = "com.karvo.developer.vantrel.allowedplugins";
 constexpr uint64_t kDiscoverAll = 0x200;
-
-Value u64(uint64_t v) {
-  return Value::unsignedInteger(v);
-}
 
 class Discovery : public DaemonTest {
  protected:

@@ -19,9 +19,6 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-using Expected = std::pair<int64_t, std::string>;
-
-Value u64(uint64_t v) { return Value::unsignedInteger(v); }
 
 uint64_t announcements() {
   return platform::notificationCount(registry::kAnnotationChangeNotification);

@@ -15,9 +15,6 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-using Expected = std::pair<int64_t, std::string>;
-
-Value u64(uint64_t v) { return Value::unsignedInteger(v); }
 
 using RequestProtocol = DaemonTest;
 
@@ -27,8 +24,10 @@ TEST_F(RequestProtocol, EnvelopeIsCheckedBeforeDispatch) {
     Expected expected;
   };
   const Case cases[] = {
-      {{{"request", "bulk"}, {"version", u64(1)}}, {7, "unsupported protocol version 1 (current 3)"}},
-      {{{"request", "bulk"}, {"version", u64(4)}}, {7, "unsupported protocol version 4 (current 3)"}},
+      {{{"request", "bulk"}, {"version", u64(1)}},
+       {7, "unsupported protocol version 1 (current 3)"}},
+      {{{"request", "bulk"}, {"version", u64(4)}},
+       {7, "unsupported protocol version 4 (current 3)"}},
       {{{"request", "bulk"}}, {7, "unsupported protocol version 0 (current 3)"}},
       {{{"request", "bulk"}, {"version", "3"}}, {7, "unsupported protocol version 0 (current 3)"}},
       {{{"request", "bulk"}, {"version", u64((1ull << 32) + 2)}},
@@ -80,7 +79,8 @@ TEST_F(RequestProtocol, PathsAreDecodedAndCanonicalised) {
   for (const Case& c : cases) {
     Dictionary extras;
     if (!c.paths.isNull()) extras = extras.setting("paths", c.paths);
-    EXPECT_EQ(errorOf(request(c.type, extras)), c.expected) << c.type << " " << lmo::describe(c.paths);
+    EXPECT_EQ(errorOf(request(c.type, extras)), c.expected)
+        << c.type << " " << lmo::describe(c.paths);
   }
   EXPECT_EQ(log.count("failed to register plug-in at " + notABundle), 1u);
   ASSERT_NE(registry_->plugInForUrl(loose), nullptr);
@@ -124,8 +124,9 @@ TEST_F(RequestProtocol, UuidListsAreDecodedInOrder) {
   }
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), std::nullopt);
   // Elements before the bad one keep their effect.
-  EXPECT_EQ(errorOf(request("annotate", {{"annotations", change}, {"uuids", Array{widget, unknown}}})),
-            Expected(4, "no such plugin (uuid not found)"));
+  EXPECT_EQ(
+      errorOf(request("annotate", {{"annotations", change}, {"uuids", Array{widget, unknown}}})),
+      Expected(4, "no such plugin (uuid not found)"));
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), change);
 }
 
