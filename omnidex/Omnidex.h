@@ -26,8 +26,9 @@ struct OmnidexConfig {
   std::vector<std::string> plugInDirectories;       // hold stand-alone plug-in bundles
 
   // VANTREL_STATE_DIR (platform::stateDirectory()), VANTREL_APP_DIRS
-  // (default "/Applications:/System/Applications") and VANTREL_PLUGIN_DIRS
-  // (default "/System/Library/PlugIns"), colon-separated.
+  // (default "/Applications:<system>/Applications") and VANTREL_PLUGIN_DIRS
+  // (default "<system>/Library/PlugIns"), colon-separated, where <system> is
+  // platform::systemVolumeDirectory() ("/System").
   static OmnidexConfig fromEnvironment();
 };
 

@@ -21,9 +21,10 @@ std::vector<std::string> directoryList(const char* variable, std::vector<std::st
 OmnidexConfig OmnidexConfig::fromEnvironment() {
   OmnidexConfig config;
   config.stateDirectory = platform::stateDirectory();
+  const std::string system = platform::systemVolumeDirectory();
   config.applicationDirectories =
-      directoryList("VANTREL_APP_DIRS", {"/Applications", "/System/Applications"});
-  config.plugInDirectories = directoryList("VANTREL_PLUGIN_DIRS", {"/System/Library/PlugIns"});
+      directoryList("VANTREL_APP_DIRS", {"/Applications", system + "/Applications"});
+  config.plugInDirectories = directoryList("VANTREL_PLUGIN_DIRS", {system + "/Library/PlugIns"});
   return config;
 }
 

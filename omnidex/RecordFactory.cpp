@@ -5,6 +5,7 @@
 #include <utility>
 
 #include "omnidex/BundlePaths.h"
+#include "platform/Paths.h"
 
 namespace vantrel::omnidex {
 namespace {
@@ -13,7 +14,6 @@ constexpr const char* kDisplayNameKey = "KBBundleDisplayName";
 constexpr const char* kNameKey = "KBBundleName";
 constexpr const char* kBundleIdentifierKey = "KBBundleIdentifier";
 constexpr const char* kBundleVersionKey = "KBBundleVersion";
-constexpr std::string_view kSystemPrefix = "/System/";
 
 std::optional<std::string> stringFor(const lmo::Dictionary& d, const char* key) {
   if (const std::string* s = d.get(key).getIfString()) return *s;
@@ -44,7 +44,7 @@ PlugInRecordPtr makePlugInRecord(const std::string& path, const PlugInInfo& meta
   record->infoDictionary = metadata.info;
   record->entitlements = entitlements;
   record->registrationDate = identity.registrationDate;
-  record->onSystemPartition = path.starts_with(kSystemPrefix);
+  record->onSystemPartition = platform::isOnSystemVolume(path);
   record->containingApplication = std::move(containingApplication);
   record->localizedName = displayName(path, metadata.info);
   record->localizedShortName = stringFor(metadata.info, kNameKey);

@@ -56,7 +56,7 @@ struct PlugInRecord {
   // empty.
   lmo::Dictionary entitlements;
   std::optional<lmo::Date> registrationDate;
-  bool onSystemPartition = false;              // the bundle path begins with "/System/"
+  bool onSystemPartition = false;              // platform::isOnSystemVolume(bundle path)
   ApplicationRecordPtr containingApplication;  // null for a stand-alone plug-in
   // "KBBundleDisplayName", else "KBBundleName", else the bundle directory's
   // name without its extension.

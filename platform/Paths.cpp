@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstdlib>
 #include <filesystem>
 #include <system_error>
@@ -13,6 +14,8 @@
 
 namespace vantrel::platform {
 namespace {
+
+constexpr std::string_view kDefaultSystemVolume = "/System";
 
 // The variable's value, or nullptr when it is unset or empty.
 const char* environment(const char* name) {
@@ -43,6 +46,19 @@ std::string preferencesDirectory() {
   }
   const char* home = environment("HOME");
   return std::string(home != nullptr ? home : "") + "/.config/vantrel/preferences";
+}
+
+std::string systemVolumeDirectory() {
+  const char* dir = environment("VANTREL_SYSTEM_DIR");
+  // A relative or otherwise odd value must not widen what counts as system.
+  std::optional<std::string> normal =
+      dir != nullptr && dir[0] == '/' ? normalizePath(dir, PATH_MAX) : std::nullopt;
+  return normal && *normal != "/" ? *normal : std::string(kDefaultSystemVolume);
+}
+
+bool isOnSystemVolume(std::string_view path) {
+  const std::string volume = systemVolumeDirectory();
+  return path.size() > volume.size() + 1 && path.starts_with(volume) && path[volume.size()] == '/';
 }
 
 std::vector<std::string> sdkDirectories() {

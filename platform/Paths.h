@@ -28,6 +28,16 @@ std::string runtimeDirectory();
 // has its own directory below it (see platform/Preferences.h).
 std::string preferencesDirectory();
 
+// The read-only system volume: bundles below it are system-resident, and
+// stand-alone plug-ins are accepted only there. VANTREL_SYSTEM_DIR if set
+// (an image mounted elsewhere, or a test's tree); default "/System". Always
+// absolute and without a trailing slash.
+std::string systemVolumeDirectory();
+
+// Whether path lies below systemVolumeDirectory(). A plain prefix test with
+// the separator: the directory itself, or "/Systemic/x", is not below it.
+bool isOnSystemVolume(std::string_view path);
+
 // VANTREL_SDK_DIRS split on ':' (empty parts dropped); default
 // {"/usr/share/vantrel/sdks"}.
 std::vector<std::string> sdkDirectories();

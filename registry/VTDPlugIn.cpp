@@ -7,6 +7,7 @@
 
 #include "base/Log.h"
 #include "model/MetadataKeys.h"
+#include "platform/Paths.h"
 
 namespace vantrel::registry {
 
@@ -16,9 +17,6 @@ using omnidex::LookupScope;
 
 namespace {
 
-// The prefix every stand-alone plug-in's path must have. The trailing
-// separator matters: "/System" itself or "/Systemic/..." does not qualify.
-constexpr std::string_view kSystemPrefix = "/System/";
 // Info dictionary keys that prunedInfoDictionaryFor drops.
 constexpr std::string_view kBuildKeyPrefix = "DT";
 
@@ -101,7 +99,7 @@ std::optional<base::Error> VTDPlugIn::diagnose() const {
   if (std::optional<base::Error> error = VTPlugInCore::diagnose()) return error;
   const bool hasContainer = oxproxy_ && oxproxy_->dataContainerPath.has_value();
   if (!isData() && !hasContainer) return invalid("this plug-in has no sandbox data container");
-  if (!containingUrl() && !path().value_or("").starts_with(kSystemPrefix)) {
+  if (!containingUrl() && !platform::isOnSystemVolume(path().value_or(""))) {
     return invalid("plug-ins outside containing apps must be in /System");
   }
   return std::nullopt;

@@ -63,8 +63,8 @@ class VTDPlugIn : public model::VTPlugInCore {
   std::optional<lmo::Dictionary> bundleInfoDictionary() const override;
 
   // The base's rules, then: a plug-in that is not data-only needs a data
-  // container, and a plug-in outside an application must lie under
-  // "/System/". Code 12, as the base.
+  // container, and a plug-in outside an application must lie on the system
+  // volume (platform::isOnSystemVolume). Code 12, as the base.
   std::optional<base::Error> diagnose() const override;
 
   // ---- Display names ----

@@ -2,6 +2,8 @@
 
 #include <filesystem>
 
+#include "omnidex/RecordFactory.h"
+#include "platform/Paths.h"
 #include "tests/omnidex/OmnidexFixtures.h"
 
 namespace vantrel::omnidex {
@@ -32,12 +34,18 @@ TEST(OmnidexConfig, DirectoryListsComeFromTheEnvironment) {
     const char* plugIns;
     std::vector<std::string> expectedApps;
     std::vector<std::string> expectedPlugIns;
+    const char* system = nullptr;
   } cases[] = {
       {nullptr, nullptr, defaultApps, defaultPlugIns},
       {"/a::/b:", "/p", {"/a", "/b"}, {"/p"}},
       {"", ":", {}, {}},
+      {nullptr, nullptr, {"/Applications", "/img/Applications"}, {"/img/Library/PlugIns"}, "/img/"},
+      // Only an absolute directory other than "/" may stand for the volume.
+      {nullptr, nullptr, defaultApps, defaultPlugIns, "img"},
+      {nullptr, nullptr, defaultApps, defaultPlugIns, "/"},
   };
   for (const auto& c : cases) {
+    ScopedEnvironment system("VANTREL_SYSTEM_DIR", c.system);
     ScopedEnvironment apps("VANTREL_APP_DIRS", c.apps);
     ScopedEnvironment plugIns("VANTREL_PLUGIN_DIRS", c.plugIns);
     ScopedEnvironment state("VANTREL_STATE_DIR", "/somewhere/state");
@@ -45,6 +53,29 @@ TEST(OmnidexConfig, DirectoryListsComeFromTheEnvironment) {
     EXPECT_EQ(config.stateDirectory, "/somewhere/state");
     EXPECT_EQ(config.applicationDirectories, c.expectedApps);
     EXPECT_EQ(config.plugInDirectories, c.expectedPlugIns);
+  }
+}
+
+TEST(OmnidexConfig, SystemResidenceFollowsTheSystemVolume) {
+  const struct {
+    const char* system;  // null: unset
+    const char* path;
+    bool resident;
+  } cases[] = {
+      {nullptr, "/System/Library/PlugIns/p.appex", true},
+      {nullptr, "/System", false},
+      {nullptr, "/System/", false},
+      {nullptr, "/Systemic/p.appex", false},
+      {"/img/System", "/img/System/p.appex", true},
+      {"/img/System", "/System/p.appex", false},
+      {"/img/System/", "/img/System/p.appex", true},
+  };
+  for (const auto& c : cases) {
+    ScopedEnvironment system("VANTREL_SYSTEM_DIR", c.system);
+    EXPECT_EQ(platform::isOnSystemVolume(c.path), c.resident) << c.path;
+    const PlugInRecordPtr record =
+        makePlugInRecord(c.path, PlugInInfo{}, {}, PlugInIdentity{}, nullptr, {});
+    EXPECT_EQ(record->onSystemPartition, c.resident) << c.path;
   }
 }
 
