@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <openssl/crypto.h>
+#include <openssl/rand.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -11,6 +12,7 @@
 #include <cstdlib>
 #include <mutex>
 #include <set>
+#include <string_view>
 
 #include "platform/Digest.h"
 #include "platform/Paths.h"
@@ -28,7 +30,7 @@ constexpr int kFirstHandle = 3;  // above the standard streams
 
 // --- random bytes and hex ---
 
-// Fills size bytes from the kernel's generator; 0 or errno.
+// Fills size bytes from the kernel's generator; 0 or errno. For the secret.
 int randomBytes(uint8_t* out, size_t size) {
   while (size > 0) {
     const ssize_t n = ::getrandom(out, size, 0);
@@ -40,6 +42,12 @@ int randomBytes(uint8_t* out, size_t size) {
     size -= static_cast<size_t>(n);
   }
   return 0;
+}
+
+// A nonce from OpenSSL's generator (a DRBG the kernel seeds, reseeded after
+// fork): a match issues a token per plug-in, and a system call each adds up.
+int nonceBytes(uint8_t* out, size_t size) {
+  return RAND_bytes(out, static_cast<int>(size)) == 1 ? 0 : EIO;
 }
 
 int hexValue(char c) {
@@ -101,19 +109,82 @@ std::string secretPath() {
   return stateDirectory() + "/" + kSandboxSecretFileName;
 }
 
-// Reads the secret; 0 and the bytes, or errno. A secret that others could
-// read (or that someone else owns) is refused: it would let them forge.
+// A secret file's identity and every attribute that a change of its content,
+// owner or mode touches (ctime moves with each of them).
+struct SecretStamp {
+  dev_t device = 0;
+  ino_t inode = 0;
+  mode_t mode = 0;
+  uid_t owner = 0;
+  off_t size = 0;
+  timespec modified{}, changed{};
+
+  explicit SecretStamp(const struct stat& st)
+      : device(st.st_dev),
+        inode(st.st_ino),
+        mode(st.st_mode),
+        owner(st.st_uid),
+        size(st.st_size),
+        modified(st.st_mtim),
+        changed(st.st_ctim) {}
+  SecretStamp() = default;
+  bool operator==(const SecretStamp& o) const {
+    return device == o.device && inode == o.inode && mode == o.mode && owner == o.owner &&
+           size == o.size && modified.tv_sec == o.modified.tv_sec &&
+           modified.tv_nsec == o.modified.tv_nsec && changed.tv_sec == o.changed.tv_sec &&
+           changed.tv_nsec == o.changed.tv_nsec;
+  }
+};
+
+// The last secret read, kept while its file is unchanged: one stat instead
+// of an open and a read per token. Deleting, replacing or loosening the file
+// still takes effect at the next issue or consume.
+class SecretCache {
+ public:
+  bool find(const std::string& path, const SecretStamp& stamp, std::string* secret) {
+    std::lock_guard lock(mutex_);
+    if (path != path_ || !(stamp == stamp_)) return false;
+    *secret = secret_;
+    return true;
+  }
+  void remember(const std::string& path, const SecretStamp& stamp, const std::string& secret) {
+    std::lock_guard lock(mutex_);
+    path_ = path;
+    stamp_ = stamp;
+    secret_ = secret;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::string path_;    // guarded by mutex_
+  SecretStamp stamp_;   // guarded by mutex_
+  std::string secret_;  // guarded by mutex_
+};
+
+SecretCache& secretCache() {
+  static SecretCache* cache = new SecretCache;  // never destroyed: used until exit
+  return *cache;
+}
+
+// A secret that others could read (or that someone else owns) is refused:
+// it would let them forge. 0 or EACCES.
+int checkSecretFile(const struct stat& st) {
+  return S_ISREG(st.st_mode) && st.st_uid == ::geteuid() && (st.st_mode & 077) == 0 ? 0 : EACCES;
+}
+
+// Reads the secret; 0 and the bytes, or errno.
 int readSecret(const std::string& path, std::string* secret) {
+  struct stat st;
+  if (::fstatat(AT_FDCWD, path.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+  if (int err = checkSecretFile(st)) return err;
+  if (secretCache().find(path, SecretStamp(st), secret)) return 0;
   const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
   if (fd < 0) return errno;
-  struct stat st;
   int err = 0;
   char buffer[kSandboxSecretBytes + 1];
   if (::fstat(fd, &st) != 0) {
     err = errno;
-  } else if (!S_ISREG(st.st_mode) || st.st_uid != ::geteuid() || (st.st_mode & 077) != 0) {
-    err = EACCES;
-  } else {
+  } else if ((err = checkSecretFile(st)) == 0) {
     const ssize_t n = ::read(fd, buffer, sizeof buffer);
     if (n < 0) {
       err = errno;
@@ -121,6 +192,7 @@ int readSecret(const std::string& path, std::string* secret) {
       err = EINVAL;  // damaged: better to refuse than to run with a short key
     } else {
       secret->assign(buffer, kSandboxSecretBytes);
+      secretCache().remember(path, SecretStamp(st), *secret);
     }
   }
   ::close(fd);
@@ -167,6 +239,30 @@ std::string macFor(const std::string& secret, const uint8_t* nonce, const std::s
   message += path;
   const HmacSha256 mac = hmacSha256(secret, message);
   return std::string(reinterpret_cast<const char*>(mac.data()), mac.size());
+}
+
+// --- canonical paths ---
+
+// realpath(3) without its system call per component: the kernel resolves the
+// path once (an O_PATH open) and names what it found. A link name that is
+// not absolute (/proc missing, a deleted or detached file) falls back to
+// realpath. nullopt with errno when the path does not resolve.
+std::optional<std::string> canonicalPath(const std::string& path) {
+  const int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
+  if (fd < 0) return std::nullopt;
+  char link[PATH_MAX];
+  const std::string self = "/proc/self/fd/" + std::to_string(fd);
+  const ssize_t n = ::readlink(self.c_str(), link, sizeof link);
+  ::close(fd);
+  if (n > 0 && static_cast<size_t>(n) < sizeof link && link[0] == '/' &&
+      !std::string_view(link, static_cast<size_t>(n)).ends_with(" (deleted)")) {
+    return std::string(link, static_cast<size_t>(n));
+  }
+  char* resolved = ::realpath(path.c_str(), nullptr);
+  if (resolved == nullptr) return std::nullopt;  // errno from realpath
+  std::string canonical(resolved);
+  std::free(resolved);
+  return canonical;
 }
 
 // --- token parsing ---
@@ -248,10 +344,9 @@ int openReadOnly(const std::string& path) {
 }  // namespace
 
 std::optional<std::string> sandbox_extension_issue_file(const std::string& path) {
-  char* resolved = ::realpath(path.c_str(), nullptr);
-  if (resolved == nullptr) return std::nullopt;  // errno from realpath
-  const std::string canonical(resolved);
-  std::free(resolved);
+  std::optional<std::string> resolved = canonicalPath(path);
+  if (!resolved) return std::nullopt;
+  const std::string& canonical = *resolved;
   if (::faccessat(AT_FDCWD, canonical.c_str(), R_OK, AT_EACCESS) != 0) return std::nullopt;
 
   std::string secret;
@@ -260,7 +355,7 @@ std::optional<std::string> sandbox_extension_issue_file(const std::string& path)
     return std::nullopt;
   }
   uint8_t nonce[kNonceBytes];
-  if (int err = randomBytes(nonce, sizeof nonce)) {
+  if (int err = nonceBytes(nonce, sizeof nonce)) {
     errno = err;
     return std::nullopt;
   }
