@@ -90,7 +90,6 @@ TEST(ActivationRules, CountsMaxItemsAndConformance) {
        {max2, items({{"public.png"}, {"public.png"}}), kAdmitted},
        {max2, items({{"public.png"}, {"public.png"}, {}}), kTooManyItems},
        {rule({{"maxItems", n(0)}}), itemsOf({Value(Dictionary{})}), kTooManyItems},
-       {rule({}), itemsOf({}), kAdmitted},
        {rule({{"maxItems", n(0)}, {"public.item", n(0)}}), itemsOf({}), kAdmitted},
        {rule({}), jpegs(1), kUnmatchedAttachment},
        {image2, itemsOf({Value(Dictionary{{"title", "x"}})}), kAdmitted},

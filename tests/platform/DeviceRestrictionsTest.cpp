@@ -2,24 +2,19 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <limits>
 
 #include "platform/Preferences.h"
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
 using lmo::Value;
 
-void usePreferences(const testing::TempDir& dir) {
-  ::setenv("VANTREL_PREFERENCES_DIR", dir.path().c_str(), 1);
-}
-
 TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
   testing::TempDir dir, other;
-  usePreferences(dir);
+  ScopedEnv preferences("VANTREL_PREFERENCES_DIR", dir.path().string());
   EXPECT_EQ(maximumApplicationRating(), std::nullopt) << "no file";
   // Another writer with a domain object of its own, as another process has.
   Preferences writer(kRestrictionsDomain);
@@ -43,16 +38,16 @@ TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
   }
 
   // The process's own writer, and a switch to another store location.
-  usePreferences(other);
-  EXPECT_EQ(maximumApplicationRating(), std::nullopt);
-  ASSERT_TRUE(setMaximumApplicationRating(9).has_value());
-  EXPECT_EQ(maximumApplicationRating(), 9);
-  usePreferences(dir);
+  {
+    ScopedEnv elsewhere("VANTREL_PREFERENCES_DIR", other.path().string());
+    EXPECT_EQ(maximumApplicationRating(), std::nullopt);
+    ASSERT_TRUE(setMaximumApplicationRating(9).has_value());
+    EXPECT_EQ(maximumApplicationRating(), 9);
+  }
   EXPECT_EQ(maximumApplicationRating(), 17);
   ASSERT_TRUE(setMaximumApplicationRating(std::nullopt).has_value());
   writer.synchronize();
   EXPECT_TRUE(writer.valueForKey(kMaxApplicationRatingKey).isNull());
-  ::unsetenv("VANTREL_PREFERENCES_DIR");
 }
 
 }  // namespace

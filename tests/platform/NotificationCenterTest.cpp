@@ -7,22 +7,19 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdlib>
 #include <filesystem>
 #include <thread>
 #include <vector>
 
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
-// Points the runtime directory at a fresh temporary directory.
 class NotificationCenterTest : public ::testing::Test {
  protected:
-  void SetUp() override { ::setenv("VANTREL_RUNTIME_DIR", dir_.path().c_str(), 1); }
-  void TearDown() override { ::unsetenv("VANTREL_RUNTIME_DIR"); }
   testing::TempDir dir_;
+  ScopedEnv runtimeDirectory_{"VANTREL_RUNTIME_DIR", dir_.path().string()};
 };
 
 TEST_F(NotificationCenterTest, PostsCountPerNameAndAreSeenByInotify) {
@@ -46,10 +43,9 @@ TEST_F(NotificationCenterTest, PostsCountPerNameAndAreSeenByInotify) {
 
 TEST_F(NotificationCenterTest, RefusesNamesThatAreNotOneFileName) {
   const std::string longest(kMaxNotificationNameLength, 'n'), tooLong = longest + "n";
+  using namespace std::literals;
   for (const std::string_view name :
-       {std::string_view(""), std::string_view("."), std::string_view(".."),
-        std::string_view("a/b"), std::string_view("/a"), std::string_view("a\0b", 3),
-        std::string_view(tooLong)}) {
+       {""sv, "."sv, ".."sv, "a/b"sv, "/a"sv, "a\0b"sv, std::string_view(tooLong)}) {
     const auto posted = postNotification(name);
     ASSERT_FALSE(posted.has_value()) << name;
     EXPECT_EQ(posted.error().code, EINVAL);

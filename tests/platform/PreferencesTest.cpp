@@ -6,7 +6,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <thread>
@@ -14,23 +13,17 @@
 #include "base/Log.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
 constexpr const char* kDomain = "com.example.prefs";
 
-std::string plist(const std::string& key, const std::string& value) {
-  return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict><key>" + key +
-         "</key><string>" + value + "</string></dict></plist>\n";
-}
-
 class PreferencesTest : public ::testing::Test {
  protected:
-  void SetUp() override { ::setenv("VANTREL_PREFERENCES_DIR", dir_.path().c_str(), 1); }
-  void TearDown() override { ::unsetenv("VANTREL_PREFERENCES_DIR"); }
   testing::TempDir dir_;
+  ScopedEnv preferencesDirectory_{"VANTREL_PREFERENCES_DIR", dir_.path().string()};
 };
 
 TEST_F(PreferencesTest, SeesWhatAnotherProcessWroteAtTheNextSynchronize) {
@@ -39,16 +32,15 @@ TEST_F(PreferencesTest, SeesWhatAnotherProcessWroteAtTheNextSynchronize) {
   ASSERT_EQ(::gethostname(host, HOST_NAME_MAX), 0);
   ASSERT_EQ(prefs.path(), dir_.file(std::string(host) + "/" + kDomain + ".plist"));
   EXPECT_TRUE(prefs.valueForKey("k").isNull());  // no file: an empty domain
-  dir_.write(std::string(host) + "/" + kDomain + ".plist", plist("k", "one"));
+  dir_.write(std::string(host) + "/" + kDomain + ".plist", stringsPlist({{"k", "one"}}));
   EXPECT_TRUE(prefs.valueForKey("k").isNull()) << "read again without synchronize";
   prefs.synchronize();
   EXPECT_EQ(prefs.valueForKey("k"), lmo::Value("one"));
 
   // Rewritten in place: same inode, same size. Only the modification time
   // tells the two versions apart.
-  struct stat before;
-  ASSERT_EQ(::stat(prefs.path().c_str(), &before), 0);
-  std::ofstream(prefs.path(), std::ios::trunc) << plist("k", "two");
+  const struct stat before = statOf(prefs.path());
+  std::ofstream(prefs.path(), std::ios::trunc) << stringsPlist({{"k", "two"}});
   struct timespec times[2] = {before.st_atim, before.st_mtim};
   ASSERT_EQ(::utimensat(AT_FDCWD, prefs.path().c_str(), times, 0), 0);
   prefs.synchronize();
@@ -66,11 +58,7 @@ TEST_F(PreferencesTest, SeesWhatAnotherProcessWroteAtTheNextSynchronize) {
 TEST_F(PreferencesTest, UnusableFilesAreAnEmptyDomainLoggedOnceAndNeverReplaced) {
   Preferences prefs(kDomain);
   ASSERT_TRUE(ensureDirectory(prefs.path().substr(0, prefs.path().rfind('/')), 0700).has_value());
-  using Make = void (*)(const std::string&);
-  const struct {
-    const char* what;
-    Make make;
-  } cases[] = {
+  const std::pair<const char*, void (*)(const std::string&)> cases[] = {
       {"not a property list", [](const std::string& p) { std::ofstream(p) << "<plist>oops"; }},
       {"too large",
        [](const std::string& p) {
@@ -80,27 +68,25 @@ TEST_F(PreferencesTest, UnusableFilesAreAnEmptyDomainLoggedOnceAndNeverReplaced)
       {"a directory", [](const std::string& p) { ::mkdir(p.c_str(), 0700); }},
       {"a FIFO", [](const std::string& p) { ::mkfifo(p.c_str(), 0600); }},
   };
-  for (const auto& c : cases) {
+  for (const auto& [what, make] : cases) {
     std::filesystem::remove_all(prefs.path());
-    std::ofstream(prefs.path()) << plist("k", "good");
+    std::ofstream(prefs.path()) << stringsPlist({{"k", "good"}});
     prefs.synchronize();
     ASSERT_EQ(prefs.valueForKey("k"), lmo::Value("good"));
     std::filesystem::remove(prefs.path());
-    c.make(prefs.path());
+    make(prefs.path());
 
     base::LogCapture log;
     prefs.synchronize();
     prefs.synchronize();
-    EXPECT_TRUE(prefs.valueForKey("k").isNull()) << c.what;
-    EXPECT_EQ(log.lines().size(), 1u) << c.what;
-    EXPECT_TRUE(log.contains(prefs.path())) << c.what;
+    EXPECT_TRUE(prefs.valueForKey("k").isNull()) << what;
+    EXPECT_EQ(log.lines().size(), 1u) << what;
+    EXPECT_TRUE(log.contains(prefs.path())) << what;
 
     // Replacing would give the path a new inode.
-    struct stat before, after;
-    ASSERT_EQ(::stat(prefs.path().c_str(), &before), 0) << c.what;
-    EXPECT_FALSE(prefs.setValue("k", lmo::Value("new")).has_value()) << c.what;
-    ASSERT_EQ(::stat(prefs.path().c_str(), &after), 0) << c.what;
-    EXPECT_EQ(after.st_ino, before.st_ino) << c.what;
+    const ino_t inode = statOf(prefs.path()).st_ino;
+    EXPECT_FALSE(prefs.setValue("k", lmo::Value("new")).has_value()) << what;
+    EXPECT_EQ(statOf(prefs.path()).st_ino, inode) << what;
   }
 }
 

@@ -6,6 +6,7 @@
 
 #include <climits>
 #include <cstdint>
+#include <cstring>
 #include <map>
 #include <sstream>
 #include <string>
@@ -16,47 +17,35 @@ namespace vantrel::probes {
 namespace {
 
 // The probes of provider "vantreld" in this test binary's SDT notes: probe
-// name (as stored, with "__" for "-") -> semaphore address.
+// name (as stored, with "__" for "-") -> semaphore address, 0 for none.
 std::map<std::string, uint64_t> probesInThisBinary() {
-  char self[PATH_MAX];
-  ssize_t n = ::readlink("/proc/self/exe", self, sizeof self - 1);
-  if (n <= 0) return {};
-  self[n] = '\0';
+  char self[PATH_MAX] = {};
+  if (::readlink("/proc/self/exe", self, sizeof self - 1) <= 0) return {};
   // readelf must be given our own path: its /proc/self would be readelf.
-  std::string command = std::string("readelf -n '") + self + "'";
-  FILE* pipe = ::popen(command.c_str(), "r");
+  FILE* pipe = ::popen((std::string("readelf -n '") + self + "'").c_str(), "r");
   if (pipe == nullptr) return {};
-  std::string output;
-  char buffer[4096];
-  while (size_t got = fread(buffer, 1, sizeof buffer, pipe)) output.append(buffer, got);
-  ::pclose(pipe);
-
   std::map<std::string, uint64_t> probes;
-  std::istringstream lines(output);
-  std::string line, provider, name;
-  while (std::getline(lines, line)) {
+  std::string provider, name, key;
+  char line[4096];
+  while (std::fgets(line, sizeof line, pipe) != nullptr) {
     std::istringstream words(line);
-    std::string key;
     words >> key;
-    if (key == "Provider:") {
-      words >> provider;
-    } else if (key == "Name:") {
-      words >> name;
-    } else if (key == "Location:" && provider == "vantreld") {
-      size_t at = line.find("Semaphore: ");
-      probes[name] = at == std::string::npos ? 0 : std::stoull(line.substr(at + 11), nullptr, 16);
+    if (key == "Provider:") words >> provider;
+    if (key == "Name:") words >> name;
+    if (key == "Location:" && provider == "vantreld") {
+      const char* semaphore = std::strstr(line, "Semaphore: ");
+      probes[name] = semaphore ? std::strtoull(semaphore + 11, nullptr, 16) : 0;
     }
   }
+  ::pclose(pipe);
   return probes;
 }
 
-TEST(Probes, EveryProbeIsInTheBinaryAndTheGuardedOnesHaveSemaphores) {
+// Which probes there are is check_probes.sh's to say (platform.check_probes
+// runs it on this binary); here: no more than those, and the guarded two can
+// be enabled by a tracer.
+TEST(Probes, TenProbesAndTheGuardedOnesHaveSemaphores) {
   std::map<std::string, uint64_t> probes = probesInThisBinary();
-  for (const char* name :
-       {"client__new", "client__done", "request", "request__input", "request__output", "db__load",
-        "discover__raw", "plugin__add", "plugin__ready", "plugin__remove"}) {
-    EXPECT_TRUE(probes.contains(name)) << name;
-  }
   EXPECT_EQ(probes.size(), 10u);
   EXPECT_NE(probes["request__input"], 0u);
   EXPECT_NE(probes["request__output"], 0u);

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "tests/platform/PeerBundles.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
@@ -17,10 +17,16 @@ namespace fs = std::filesystem;
 using lmo::Dictionary;
 using lmo::Value;
 
-Dictionary instance(const char* identifier, pid_t pid, const std::string& bundle) {
-  return Dictionary{{kInstanceBundleIdentifierKey, Value(identifier)},
-                    {kInstancePidKey, Value::integer(pid)},
-                    {kInstanceBundlePathKey, Value(bundle)}};
+// The instances of com.example.p with these pids in bundle, in pid order.
+std::vector<Dictionary> instances(const std::string& bundle, std::vector<pid_t> pids) {
+  std::sort(pids.begin(), pids.end());
+  std::vector<Dictionary> out;
+  for (pid_t pid : pids) {
+    out.push_back(Dictionary{{kInstanceBundleIdentifierKey, Value("com.example.p")},
+                             {kInstancePidKey, Value::integer(pid)},
+                             {kInstanceBundlePathKey, Value(bundle)}});
+  }
+  return out;
 }
 
 TEST(ProcessAssertions, RunningInstancesAreTheProcessesStartedFromInsideTheBundle) {
@@ -35,8 +41,7 @@ TEST(ProcessAssertions, RunningInstancesAreTheProcessesStartedFromInsideTheBundl
   auto second = startSleepingPeer(exe);
   auto other = startSleepingPeer(sibling);
   ASSERT_TRUE(first && second && other);
-  const std::vector<Dictionary> both{instance("com.example.p", first->pid(), bundle),
-                                     instance("com.example.p", second->pid(), bundle)};
+  const std::vector<Dictionary> both = instances(bundle, {first->pid(), second->pid()});
   struct Case {
     const char* name;
     std::vector<std::string> paths;
@@ -49,19 +54,13 @@ TEST(ProcessAssertions, RunningInstancesAreTheProcessesStartedFromInsideTheBundl
       {"missing-and-bundle", {tmp.file("gone.appex"), bundle}, both},
       {"application-around-it",
        {tmp.file("A.app")},
-       {instance("com.example.p", first->pid(), tmp.file("A.app")),
-        instance("com.example.p", second->pid(), tmp.file("A.app")),
-        instance("com.example.p", other->pid(), tmp.file("A.app"))}},
+       instances(tmp.file("A.app"), {first->pid(), second->pid(), other->pid()})},
       {"executable-itself", {exe}, {}},
       {"none", {}, {}},
       {"missing", {tmp.file("gone.appex")}, {}},
   };
   for (const Case& c : cases) {
-    std::vector<Dictionary> expected = c.expected;
-    std::sort(expected.begin(), expected.end(), [](const Dictionary& a, const Dictionary& b) {
-      return a.get(kInstancePidKey).integerValue() < b.get(kInstancePidKey).integerValue();
-    });
-    EXPECT_EQ(runningInstances("com.example.p", c.paths), expected) << c.name;
+    EXPECT_EQ(runningInstances("com.example.p", c.paths), c.expected) << c.name;
   }
 }
 
@@ -71,7 +70,7 @@ TEST(ProcessAssertions, AnInstanceCountsUntilItExitsEvenWhenItsExecutableIsGone)
   const std::string exe = makePeerBundle(tmp, "P.appex", "com.example.p");
   auto peer = startSleepingPeer(exe);
   ASSERT_TRUE(peer);
-  const std::vector<Dictionary> running{instance("com.example.p", peer->pid(), bundle)};
+  const std::vector<Dictionary> running = instances(bundle, {peer->pid()});
   EXPECT_EQ(runningInstances("com.example.p", {bundle}), running);
 
   // A bundle being replaced: the old executable still runs.

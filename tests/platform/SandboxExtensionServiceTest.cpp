@@ -4,45 +4,36 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cstdlib>
+#include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <thread>
 #include <vector>
 
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
-// Each test gets its own state directory, and so its own secret.
 class SandboxExtension : public ::testing::Test {
  protected:
-  SandboxExtension() : stateDir_(dir_.file("state")) {
-    ::setenv("VANTREL_STATE_DIR", stateDir_.c_str(), 1);
-  }
-  ~SandboxExtension() override { ::unsetenv("VANTREL_STATE_DIR"); }
-
   std::string secretFile() const { return stateDir_ + "/" + kSandboxSecretFileName; }
-  std::string secret() const {
-    std::ifstream in(secretFile(), std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
   // Consumes token and returns what reading the handle's descriptor gives.
   std::string readThrough(const std::string& token) {
     const int64_t handle = sandbox_extension_consume(token);
     EXPECT_GE(handle, 3);
     if (handle < 0) return "(consume failed)";
-    const int fd = sandbox_extension_descriptor(handle);
-    EXPECT_EQ(fd, handle);
     char buffer[256];
-    const ssize_t n = ::pread(fd, buffer, sizeof buffer, 0);
+    const ssize_t n = ::pread(sandbox_extension_descriptor(handle), buffer, sizeof buffer, 0);
     EXPECT_EQ(sandbox_extension_release(handle), 0);
     return n < 0 ? "(read failed)" : std::string(buffer, static_cast<size_t>(n));
   }
 
   vantrel::testing::TempDir dir_;
-  std::string stateDir_;
+  // Each test gets its own state directory, and so its own secret.
+  const std::string stateDir_ = dir_.file("state");
+  ScopedEnv stateDirectory_{"VANTREL_STATE_DIR", stateDir_};
 };
 
 TEST_F(SandboxExtension, IssuedTokenOpensThePathReadOnly) {
@@ -73,6 +64,11 @@ TEST_F(SandboxExtension, RefusesMalformedAndForgedTokens) {
   const std::string file = dir_.write("f", "x");
   const std::string other = dir_.write("g", "y");
   const std::string token = sandbox_extension_issue_file(file).value();
+  std::string foreign;  // made with another installation's secret
+  {
+    ScopedEnv otherInstallation("VANTREL_STATE_DIR", dir_.file("other-state"));
+    foreign = sandbox_extension_issue_file(file).value();
+  }
   // "1;<32 hex>;<64 hex>;<path>"
   const size_t macAt = 2 + 32 + 1, pathAt = macAt + 64 + 1;
   auto flipped = [&](size_t at) {
@@ -82,7 +78,6 @@ TEST_F(SandboxExtension, RefusesMalformedAndForgedTokens) {
   };
   const std::string cases[] = {
       "",
-      "garbage",
       token.substr(0, pathAt - 1),
       token.substr(0, token.size() - 1),  // the path shortened
       token.substr(0, pathAt) + other,    // the path changed
@@ -93,19 +88,13 @@ TEST_F(SandboxExtension, RefusesMalformedAndForgedTokens) {
       token.substr(0, pathAt) + "/bad%G1",
       token.substr(0, pathAt) + "/nul%00",
       token + std::string(kMaxSandboxTokenLength, 'x'),
+      foreign,
   };
   for (const std::string& forged : cases) {
     errno = 0;
     EXPECT_EQ(sandbox_extension_consume(forged), -1) << forged;
     EXPECT_EQ(errno, EINVAL) << forged;
   }
-
-  // A token made with another installation's secret does not verify here.
-  ::setenv("VANTREL_STATE_DIR", dir_.file("other-state").c_str(), 1);
-  const std::string foreign = sandbox_extension_issue_file(file).value();
-  ::setenv("VANTREL_STATE_DIR", stateDir_.c_str(), 1);
-  EXPECT_EQ(sandbox_extension_consume(foreign), -1);
-  EXPECT_EQ(errno, EINVAL);
 }
 
 TEST_F(SandboxExtension, IssueFailsForPathsThatCannotBeRead) {
@@ -138,25 +127,35 @@ TEST_F(SandboxExtension, SecretIsPrivateMadeOnceAndReused) {
   for (std::thread& t : threads) t.join();
   for (const std::string& t : tokens) EXPECT_EQ(readThrough(t), "contents");
 
-  struct stat st;
-  ASSERT_EQ(::stat(secretFile().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
-  EXPECT_EQ(st.st_size, static_cast<off_t>(kSandboxSecretBytes));
-  ASSERT_EQ(::stat(stateDir_.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0700u);
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(stateDir_),
-                          std::filesystem::directory_iterator()),
-            1);  // no temporaries left behind
-
-  const std::string before = secret();
+  EXPECT_EQ(modeOf(secretFile()), 0600u);
+  EXPECT_EQ(modeOf(stateDir_), 0700u);
+  const std::string before = contentsOf(secretFile());
+  EXPECT_EQ(before.size(), kSandboxSecretBytes);
+  EXPECT_EQ(entryCount(stateDir_), 1);  // no temporaries left behind
   EXPECT_TRUE(sandbox_extension_issue_file(file).has_value());
-  EXPECT_EQ(secret(), before);
+  EXPECT_EQ(contentsOf(secretFile()), before);
+
+  // The secret is kept in memory only while its file is unchanged: a new
+  // one, even of the same size written in place, revokes earlier tokens.
+  std::string other = before;
+  other[0] = static_cast<char>(other[0] ^ 1);
+  {
+    std::ofstream rewrite(secretFile(), std::ios::binary | std::ios::trunc);
+    rewrite << other;
+  }
+  EXPECT_EQ(sandbox_extension_consume(tokens[0]), -1);
+  EXPECT_EQ(errno, EINVAL);
+  ::unlink(secretFile().c_str());
+  const std::string fresh = sandbox_extension_issue_file(file).value_or("");
+  EXPECT_EQ(readThrough(fresh), "contents");
+  EXPECT_NE(contentsOf(secretFile()), before);
+  EXPECT_EQ(sandbox_extension_consume(tokens[1]), -1);
 
   // A secret that others can read could be used to forge: refuse it.
   ::chmod(secretFile().c_str(), 0644);
   EXPECT_FALSE(sandbox_extension_issue_file(file).has_value());
   EXPECT_EQ(errno, EACCES);
-  EXPECT_EQ(sandbox_extension_consume(tokens[0]), -1);
+  EXPECT_EQ(sandbox_extension_consume(fresh), -1);
 }
 
 TEST_F(SandboxExtension, TokenForASymlinkNamesTheCanonicalTarget) {

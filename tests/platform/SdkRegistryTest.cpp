@@ -1,40 +1,19 @@
 #include "platform/SdkRegistry.h"
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
+#include <filesystem>
 #include <optional>
 #include <string>
 
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
 std::string sdkPlist(const char* origin) {
-  return std::string("<plist version=\"1.0\"><dict><key>origin</key><string>") + origin +
-         "</string></dict></plist>";
+  return stringsPlist({{"origin", origin}});
 }
-
-// Points VANTREL_SDK_DIRS at a value for the lifetime of the object.
-class ScopedSdkDirs {
- public:
-  explicit ScopedSdkDirs(const std::string& value) {
-    if (const char* old = ::getenv(kVariable)) previous_ = old;
-    ::setenv(kVariable, value.c_str(), 1);
-  }
-  ~ScopedSdkDirs() {
-    if (previous_) {
-      ::setenv(kVariable, previous_->c_str(), 1);
-    } else {
-      ::unsetenv(kVariable);
-    }
-  }
-
- private:
-  static constexpr const char* kVariable = "VANTREL_SDK_DIRS";
-  std::optional<std::string> previous_;
-};
 
 // What the lookup found: the "origin" string of the dictionary, "" for none.
 std::string origin(const std::string& name) {
@@ -46,32 +25,29 @@ std::string origin(const std::string& name) {
 
 TEST(SdkRegistry, FirstDirectoryHoldingADictionaryWins) {
   testing::TempDir tmp;
-  ScopedSdkDirs dirs(tmp.file("first") + ":" + tmp.file("second"));
+  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
   tmp.write("first/both.plist", sdkPlist("first"));
   tmp.write("second/both.plist", sdkPlist("second"));
   tmp.write("second/later.plist", sdkPlist("second"));
   tmp.write("first/malformed.plist", "<plist><dict><key>x</key>");
   tmp.write("second/malformed.plist", sdkPlist("second"));
-  tmp.write("first/array.plist", "<plist version=\"1.0\"><array/></plist>");
+  tmp.write("first/array.plist", xmlPlist("<array/>"));
   tmp.write("second/array.plist", sdkPlist("second"));
-  tmp.write("first/only-array.plist", "<plist version=\"1.0\"><array/></plist>");
+  tmp.write("first/only-array.plist", xmlPlist("<array/>"));
   std::filesystem::create_directories(tmp.path() / "first/dir.plist");
   tmp.write("second/dir.plist", sdkPlist("second"));
   tmp.write("first/com.example.point.plist", sdkPlist("first"));
 
-  struct Case {
-    const char* name;
-    const char* origin;
-  } cases[] = {
+  const std::pair<const char*, const char*> cases[] = {
       {"both", "first"},  {"later", "second"}, {"malformed", "second"},        {"array", "second"},
       {"only-array", ""}, {"dir", "second"},   {"com.example.point", "first"}, {"missing", ""},
   };
-  for (const Case& c : cases) EXPECT_EQ(origin(c.name), c.origin) << c.name;
+  for (const auto& [name, from] : cases) EXPECT_EQ(origin(name), from) << name;
 }
 
 TEST(SdkRegistry, NamesThatCouldLeaveTheDirectoryAreNeverLookedUp) {
   testing::TempDir tmp;
-  ScopedSdkDirs dirs(tmp.file("sdks/inner"));
+  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("sdks/inner"));
   // Every file here would be found if its name were looked up as given.
   tmp.write("sdks/inner/.plist", sdkPlist("empty"));
   tmp.write("sdks/inner/..plist", sdkPlist("dot"));
@@ -79,19 +55,12 @@ TEST(SdkRegistry, NamesThatCouldLeaveTheDirectoryAreNeverLookedUp) {
   tmp.write("sdks/secret.plist", sdkPlist("secret"));
   tmp.write("sdks/inner/sub/x.plist", sdkPlist("sub"));
   tmp.write("sdks/inner/cut", sdkPlist("cut"));
-
-  const std::string refused[] = {
-      "",
-      ".",
-      "..",
-      "../secret",
-      "sub/x",
-      "/etc/passwd",
-      std::string("cut\0x", 5),
-      std::string(kMaxSdkNameLength + 1, 'n'),
-  };
-  for (const std::string& name : refused) EXPECT_EQ(origin(name), "") << name;
-  // The longest accepted name still works.
+  for (const std::string& name :
+       {std::string(), std::string("."), std::string(".."), std::string("../secret"),
+        std::string("sub/x"), std::string("cut\0x", 5)}) {
+    EXPECT_EQ(origin(name), "") << name;
+  }
+  // The longest name there can be a file for is looked up.
   tmp.write("sdks/inner/" + std::string(kMaxSdkNameLength, 'n') + ".plist", sdkPlist("max"));
   EXPECT_EQ(origin(std::string(kMaxSdkNameLength, 'n')), "max");
 }

@@ -3,39 +3,38 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <chrono>
-#include <cstdlib>
 #include <filesystem>
 #include <functional>
 #include <future>
 #include <optional>
 #include <thread>
+#include <tuple>
 
 #include "base/Log.h"
 #include "base/SerialQueue.h"
 #include "platform/AtomicFile.h"
 #include "platform/PropertyList.h"
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
 
+namespace fs = std::filesystem;
+using Registrations = std::vector<ExternalServiceRegistration>;
 constexpr uid_t kNobody = 65534;
 
 // A child that sleeps until killed, as this user or, when set, as uid.
-class HostProcess {
- public:
+struct HostProcess {
   explicit HostProcess(std::optional<uid_t> uid = std::nullopt) {
     int ready[2];
-    if (::pipe2(ready, O_CLOEXEC) != 0) std::abort();
-    pid_ = ::fork();
-    if (pid_ == 0) {
+    if (::pipe2(ready, O_CLOEXEC) != 0 || (pid = ::fork()) < 0) std::abort();
+    if (pid == 0) {
       // Raw system calls: the forked child of a threaded process has one
       // thread, and must not wait for the others' set-id handshake.
       if (uid && (::syscall(SYS_setresgid, *uid, *uid, *uid) != 0 ||
@@ -45,51 +44,49 @@ class HostProcess {
       (void)!::write(ready[1], "r", 1);
       for (;;) ::pause();
     }
-    ::close(ready[1]);
     char byte;
-    // Once it is there, the child runs as it should.
-    if (::read(ready[0], &byte, 1) != 1) std::abort();
+    // Once it has written, the child runs as it should.
+    if (::close(ready[1]) != 0 || ::read(ready[0], &byte, 1) != 1) std::abort();
     ::close(ready[0]);
-    pidfd_ = static_cast<int>(::syscall(SYS_pidfd_open, pid_, 0));
+    pidfd = static_cast<int>(::syscall(SYS_pidfd_open, pid, 0));
   }
   ~HostProcess() {
     exit();
-    ::close(pidfd_);
+    ::close(pidfd);
   }
   HostProcess(const HostProcess&) = delete;
   HostProcess& operator=(const HostProcess&) = delete;
 
-  pid_t pid() const { return pid_; }
-  int pidfd() const { return pidfd_; }
   // Kills and reaps it; the pidfd stays open.
   void exit() {
-    if (reaped_) return;
-    ::kill(pid_, SIGKILL);
-    ::waitpid(pid_, nullptr, 0);
-    reaped_ = true;
+    if (std::exchange(reaped, true)) return;
+    ::kill(pid, SIGKILL);
+    ::waitpid(pid, nullptr, 0);
   }
 
- private:
-  pid_t pid_ = -1;
-  int pidfd_ = -1;
-  bool reaped_ = false;
+  pid_t pid = -1;
+  int pidfd = -1;
+  bool reaped = false;
 };
 
 struct Fixture {
   testing::TempDir dir;
   std::string executable = dir.write("P.appex/P", "#!/bin/sh\n");
-  Fixture() { std::filesystem::permissions(executable, std::filesystem::perms::owner_all); }
+  Fixture() { fs::permissions(executable, fs::perms::owner_all); }
 
   ExternalServiceRegistration service(const char* identifier, const char* version,
                                       const HostProcess& host) const {
-    return {identifier, version, host.pid(), executable,
+    return {identifier, version, host.pid, executable,
             lmo::Dictionary{{"KBBundlePackageType", "LMO!"}}};
   }
+  bool add(ServiceManager& manager, const char* id, const char* version, const HostProcess& host) {
+    return manager.registerExternalService(service(id, version, host), host.pidfd).has_value();
+  }
   std::string launchFile(const HostProcess& host, const char* identifier) const {
-    return launchDescriptionPath(dir.path().string(), host.pid(), identifier);
+    return launchDescriptionPath(dir.path().string(), host.pid, identifier);
   }
   bool hasLaunchDirectory(pid_t pid) const {
-    return std::filesystem::exists(launchDirectoryPath(dir.path().string(), pid));
+    return fs::exists(launchDirectoryPath(dir.path().string(), pid));
   }
 };
 
@@ -113,53 +110,45 @@ bool eventually(const std::function<bool()>& condition) {
   return true;
 }
 
-std::string versionIn(const std::string& launchFile) {
-  base::Result<lmo::Value> file = readPropertyListFile(launchFile);
-  if (!file.has_value()) return "(unreadable)";
-  return decodeLaunchDescription(file.value()).value().version;
+LaunchDescription launchIn(const std::string& file) {
+  base::Result<lmo::Value> read = readPropertyListFile(file);
+  if (!read.has_value()) return {.version = "(unreadable)"};
+  return decodeLaunchDescription(read.value()).value();
 }
 
-mode_t modeOf(const std::string& path) {
-  struct stat st {};
-  ::stat(path.c_str(), &st);
-  return st.st_mode & 07777;
+size_t servicesOnDisk(const ServiceManager& manager) {
+  const lmo::Value file = readPropertyListFile(manager.path()).value();
+  return file.getIfDictionary()->get("services").getIfArray()->size();
 }
 
 TEST(ServiceManager, RemovesEveryRegistrationOfAVersionWithItsLaunchDescriptions) {
   Fixture f;
-  HostProcess host;
-  HostProcess other;
+  HostProcess host, other;
   ServiceManager manager(f.dir.path().string());
-  ASSERT_TRUE(manager.registerExternalService(f.service("a", "1", host), host.pidfd()).has_value());
-  ASSERT_TRUE(
-      manager.registerExternalService(f.service("a", "1", other), other.pidfd()).has_value());
-  ASSERT_TRUE(manager.registerExternalService(f.service("a", "2", host), host.pidfd()).has_value());
-  ASSERT_TRUE(manager.registerExternalService(f.service("b", "1", host), host.pidfd()).has_value());
+  ASSERT_TRUE(f.add(manager, "a", "1", host) && f.add(manager, "a", "1", other) &&
+              f.add(manager, "a", "2", host) && f.add(manager, "b", "1", host));
   // Two versions for one host share the file; the later one is described.
-  EXPECT_EQ(versionIn(f.launchFile(host, "a")), "2");
+  EXPECT_EQ(launchIn(f.launchFile(host, "a")).version, "2");
 
   EXPECT_EQ(remove(manager, "a", "1"), 0);
-  EXPECT_EQ(manager.registrations(), (std::vector<ExternalServiceRegistration>{
-                                         f.service("a", "2", host), f.service("b", "1", host)}));
-  EXPECT_FALSE(f.hasLaunchDirectory(other.pid()));
-  EXPECT_EQ(versionIn(f.launchFile(host, "a")), "2");
+  EXPECT_EQ(manager.registrations(),
+            (Registrations{f.service("a", "2", host), f.service("b", "1", host)}));
+  EXPECT_FALSE(f.hasLaunchDirectory(other.pid));
+  EXPECT_EQ(launchIn(f.launchFile(host, "a")).version, "2");
   EXPECT_EQ(remove(manager, "a", "1"), ESRCH);
-  EXPECT_EQ(remove(manager, "c", "2"), ESRCH);
   EXPECT_EQ(remove(manager, "a", "2"), 0);
-  EXPECT_FALSE(std::filesystem::exists(f.launchFile(host, "a")));
-  EXPECT_TRUE(std::filesystem::exists(f.launchFile(host, "b")));
+  EXPECT_FALSE(fs::exists(f.launchFile(host, "a")));
+  EXPECT_TRUE(fs::exists(f.launchFile(host, "b")));
   EXPECT_EQ(remove(manager, "b", "1"), 0);
-  EXPECT_FALSE(f.hasLaunchDirectory(host.pid()));
+  EXPECT_FALSE(f.hasLaunchDirectory(host.pid));
 
   // Enabling the same plug-in for the same host again replaces the entry.
+  ASSERT_TRUE(f.add(manager, "a", "2", host));
   ExternalServiceRegistration updated = f.service("a", "2", host);
-  ASSERT_TRUE(manager.registerExternalService(f.service("a", "2", host), host.pidfd()).has_value());
   updated.description = lmo::Dictionary{{"LMOService", lmo::Dictionary{{"_SandboxProfile", "p"}}}};
-  ASSERT_TRUE(manager.registerExternalService(updated, host.pidfd()).has_value());
-  EXPECT_EQ(manager.registrations(), std::vector<ExternalServiceRegistration>{updated});
-  EXPECT_EQ(decodeLaunchDescription(readPropertyListFile(f.launchFile(host, "a")).value())
-                ->sandboxProfile,
-            "p");
+  ASSERT_TRUE(manager.registerExternalService(updated, host.pidfd).has_value());
+  EXPECT_EQ(manager.registrations(), Registrations{updated});
+  EXPECT_EQ(launchIn(f.launchFile(host, "a")).sandboxProfile, "p");
 }
 
 TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
@@ -167,7 +156,6 @@ TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
   // As root the files go to the host's user; otherwise they stay ours.
   const bool root = ::geteuid() == 0;
   HostProcess host(root ? std::optional<uid_t>(kNobody) : std::nullopt);
-  const uid_t owner = root ? kNobody : ::geteuid();
   ServiceManager manager(f.dir.path().string());
   ExternalServiceRegistration r = f.service("com.example.p", "1.0", host);
   r.description = r.description.setting(
@@ -178,23 +166,21 @@ TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
                                                                {"A=B", "x"}}},
                       {"_SandboxProfile", "keyboard"}});
   r.dataContainer = "/data/p";
-  ASSERT_TRUE(manager.registerExternalService(r, host.pidfd()).has_value());
+  ASSERT_TRUE(manager.registerExternalService(r, host.pidfd).has_value());
 
   const std::string file = f.launchFile(host, "com.example.p");
-  const std::string hostDir = launchDirectoryPath(f.dir.path().string(), host.pid());
+  const std::string hostDir = launchDirectoryPath(f.dir.path().string(), host.pid);
   EXPECT_EQ(modeOf(f.dir.file("services")), 0711u);
   EXPECT_EQ(modeOf(hostDir), 0700u);
   EXPECT_EQ(modeOf(file), 0600u);
   EXPECT_EQ(modeOf(manager.path()), 0600u);
   for (const std::string& path : {hostDir, file}) {
-    struct stat st {};
-    ASSERT_EQ(::stat(path.c_str(), &st), 0);
-    EXPECT_EQ(st.st_uid, owner) << path;
+    EXPECT_EQ(statOf(path).st_uid, root ? kNobody : ::geteuid()) << path;
   }
-  const LaunchDescription d = decodeLaunchDescription(readPropertyListFile(file).value()).value();
+  const LaunchDescription d = launchIn(file);
   EXPECT_EQ(d.bundleIdentifier, "com.example.p");
   EXPECT_EQ(d.version, "1.0");
-  EXPECT_EQ(d.hostPid, host.pid());
+  EXPECT_EQ(d.hostPid, host.pid);
   EXPECT_EQ(d.executablePath, f.executable);
   // A number and a name holding '=' cannot be environment entries.
   EXPECT_EQ(d.environment, (std::vector<std::string>{"HOME=/home/elsewhere", "LANG=C"}));
@@ -205,54 +191,42 @@ TEST(ServiceManager, PublishesALaunchDescriptionThatOnlyItsHostCanRead) {
 
 TEST(ServiceManager, RefusesWithAnErrorNumberAndLeavesNothingBehind) {
   Fixture f;
-  HostProcess host;
-  HostProcess other;
-  HostProcess dead;
+  HostProcess host, other, dead;
   dead.exit();
   const std::string plainFile = f.dir.write("plain", "x");
+  const std::string longIdentifier(kMaxPublishedBundleIdentifierLength + 1, 'a');
   lmo::Dictionary crowded;
   for (size_t i = 0; i <= kMaxLaunchEnvironmentVariables; ++i) {
     crowded = crowded.setting(base::format("V%u", i), "x");
   }
-  struct Case {
+  const lmo::Dictionary crowdedService{
+      {"LMOService", lmo::Dictionary{{"EnvironmentVariables", crowded}}}};
+  using Reg = ExternalServiceRegistration;
+  const struct {
     const char* name;
-    std::function<void(ExternalServiceRegistration&, int& pidfd)> change;
+    std::function<void(Reg&, int& pidfd)> change;
     int error;
-  };
-  const Case cases[] = {
+  } cases[] = {
       {"exited host",
-       [&](auto& r, int& fd) {
-         r.hostPid = dead.pid();
-         fd = dead.pidfd();
-       },
-       ESRCH},
-      {"pidfd of another process", [&](auto&, int& fd) { fd = other.pidfd(); }, ESRCH},
-      {"no pidfd", [](auto&, int& fd) { fd = -1; }, ESRCH},
-      {"no executable", [&](auto& r, int&) { r.executablePath = f.dir.file("none"); }, ENOENT},
-      {"not executable", [&](auto& r, int&) { r.executablePath = plainFile; }, EACCES},
-      {"a directory", [&](auto& r, int&) { r.executablePath = f.dir.path().string(); }, EACCES},
-      {"identifier with a slash", [](auto& r, int&) { r.bundleIdentifier = "a/b"; }, EINVAL},
-      {"identifier too long",
-       [](auto& r, int&) {
-         r.bundleIdentifier.assign(kMaxPublishedBundleIdentifierLength + 1, 'a');
-       },
-       EINVAL},
+       [&](Reg& r, int& fd) { std::tie(r.hostPid, fd) = std::tuple(dead.pid, dead.pidfd); }, ESRCH},
+      {"pidfd of another process", [&](Reg&, int& fd) { fd = other.pidfd; }, ESRCH},
+      {"no pidfd", [](Reg&, int& fd) { fd = -1; }, ESRCH},
+      {"no executable", [&](Reg& r, int&) { r.executablePath = f.dir.file("none"); }, ENOENT},
+      {"not executable", [&](Reg& r, int&) { r.executablePath = plainFile; }, EACCES},
+      {"a directory", [&](Reg& r, int&) { r.executablePath = f.dir.path().string(); }, EACCES},
+      {"identifier with a slash", [](Reg& r, int&) { r.bundleIdentifier = "a/b"; }, EINVAL},
+      {"identifier too long", [&](Reg& r, int&) { r.bundleIdentifier = longIdentifier; }, EINVAL},
       {"service not a dictionary",
-       [](auto& r, int&) {
+       [](Reg& r, int&) {
          r.description = lmo::Dictionary{{"LMOService", "x"}};
        },
        EINVAL},
-      {"too many variables",
-       [&](auto& r, int&) {
-         r.description =
-             lmo::Dictionary{{"LMOService", lmo::Dictionary{{"EnvironmentVariables", crowded}}}};
-       },
-       E2BIG},
+      {"too many variables", [&](Reg& r, int&) { r.description = crowdedService; }, E2BIG},
   };
   ServiceManager manager(f.dir.path().string());
-  for (const Case& c : cases) {
-    ExternalServiceRegistration r = f.service("a", "1", host);
-    int pidfd = host.pidfd();
+  for (const auto& c : cases) {
+    Reg r = f.service("a", "1", host);
+    int pidfd = host.pidfd;
     c.change(r, pidfd);
     base::Result<void> result = manager.registerExternalService(r, pidfd);
     ASSERT_FALSE(result.has_value()) << c.name;
@@ -265,47 +239,37 @@ TEST(ServiceManager, RefusesWithAnErrorNumberAndLeavesNothingBehind) {
 
 TEST(ServiceManager, AHostsExitRemovesItsRegistrationsAndFiles) {
   Fixture f;
-  HostProcess leaving;
-  HostProcess staying;
+  HostProcess leaving, staying;
   ServiceManager manager(f.dir.path().string());
-  for (const char* id : {"a", "b"}) {
-    ASSERT_TRUE(
-        manager.registerExternalService(f.service(id, "1", leaving), leaving.pidfd()).has_value());
-  }
-  ASSERT_TRUE(
-      manager.registerExternalService(f.service("a", "1", staying), staying.pidfd()).has_value());
-  ASSERT_TRUE(f.hasLaunchDirectory(leaving.pid()));
+  ASSERT_TRUE(f.add(manager, "a", "1", leaving) && f.add(manager, "b", "1", leaving) &&
+              f.add(manager, "a", "1", staying));
+  ASSERT_TRUE(f.hasLaunchDirectory(leaving.pid));
 
   leaving.exit();
-  const std::vector<ExternalServiceRegistration> rest{f.service("a", "1", staying)};
+  const Registrations rest{f.service("a", "1", staying)};
   ASSERT_TRUE(eventually([&] { return manager.registrations() == rest; }));
-  EXPECT_FALSE(f.hasLaunchDirectory(leaving.pid()));
-  EXPECT_TRUE(std::filesystem::exists(f.launchFile(staying, "a")));
-  const lmo::Value file = readPropertyListFile(manager.path()).value();
-  EXPECT_EQ(file.getIfDictionary()->get("services").getIfArray()->size(), 1u);
+  EXPECT_FALSE(f.hasLaunchDirectory(leaving.pid));
+  EXPECT_TRUE(fs::exists(f.launchFile(staying, "a")));
+  EXPECT_EQ(servicesOnDisk(manager), 1u);
 }
 
 TEST(ServiceManager, TheTableOutlivesTheInstanceButNotItsHosts) {
   Fixture f;
-  HostProcess live;
-  HostProcess gone;
+  HostProcess live, gone;
   {
     ServiceManager first(f.dir.path().string());
-    ASSERT_TRUE(first.registerExternalService(f.service("a", "1", live), live.pidfd()).has_value());
-    ASSERT_TRUE(first.registerExternalService(f.service("b", "1", gone), gone.pidfd()).has_value());
+    ASSERT_TRUE(f.add(first, "a", "1", live) && f.add(first, "b", "1", gone));
   }
   // Exits while no manager runs.
   gone.exit();
-  std::filesystem::remove(f.launchFile(live, "a"));
+  fs::remove(f.launchFile(live, "a"));
   ServiceManager second(f.dir.path().string());
-  EXPECT_EQ(second.registrations(),
-            std::vector<ExternalServiceRegistration>{f.service("a", "1", live)});
+  EXPECT_EQ(second.registrations(), Registrations{f.service("a", "1", live)});
   // The pruned table was written back: the file alone no longer names b.
-  const lmo::Value file = readPropertyListFile(second.path()).value();
-  EXPECT_EQ(file.getIfDictionary()->get("services").getIfArray()->size(), 1u);
-  EXPECT_FALSE(f.hasLaunchDirectory(gone.pid()));
+  EXPECT_EQ(servicesOnDisk(second), 1u);
+  EXPECT_FALSE(f.hasLaunchDirectory(gone.pid));
   // The survivors' launch descriptions are published again, and watched.
-  EXPECT_TRUE(std::filesystem::exists(f.launchFile(live, "a")));
+  EXPECT_TRUE(fs::exists(f.launchFile(live, "a")));
   live.exit();
   EXPECT_TRUE(eventually([&] { return second.registrations().empty(); }));
 }
@@ -320,7 +284,7 @@ TEST(ServiceManager, AnUnreadableTableStartsEmptyAndIsReplacedAtTheNextChange) {
   ServiceManager manager(f.dir.path().string());
   EXPECT_TRUE(manager.registrations().empty());
   EXPECT_EQ(log.lines().size(), 1u);
-  ASSERT_TRUE(manager.registerExternalService(f.service("a", "1", host), host.pidfd()).has_value());
+  ASSERT_TRUE(f.add(manager, "a", "1", host));
   EXPECT_EQ(ServiceManager(f.dir.path().string()).registrations().size(), 1u);
 }
 
@@ -328,22 +292,21 @@ TEST(ServiceManager, AFailedWriteChangesNothing) {
   Fixture f;
   HostProcess host;
   ServiceManager manager(f.dir.path().string());
-  ASSERT_TRUE(manager.registerExternalService(f.service("a", "1", host), host.pidfd()).has_value());
+  ASSERT_TRUE(f.add(manager, "a", "1", host));
   // A directory where the file should be: the rename over it fails.
-  std::filesystem::remove(manager.path());
-  std::filesystem::create_directory(manager.path());
+  fs::remove(manager.path());
+  fs::create_directory(manager.path());
 
   base::Result<void> refused =
-      manager.registerExternalService(f.service("b", "1", host), host.pidfd());
+      manager.registerExternalService(f.service("b", "1", host), host.pidfd);
   ASSERT_FALSE(refused.has_value());
   EXPECT_EQ(refused.error().domain, kPosixErrorDomain);
-  EXPECT_FALSE(std::filesystem::exists(f.launchFile(host, "b")));
+  EXPECT_FALSE(fs::exists(f.launchFile(host, "b")));
   const int result = remove(manager, "a", "1");
   EXPECT_NE(result, 0);
   EXPECT_NE(result, ESRCH);
-  EXPECT_EQ(manager.registrations(),
-            std::vector<ExternalServiceRegistration>{f.service("a", "1", host)});
-  EXPECT_TRUE(std::filesystem::exists(f.launchFile(host, "a")));
+  EXPECT_EQ(manager.registrations(), Registrations{f.service("a", "1", host)});
+  EXPECT_TRUE(fs::exists(f.launchFile(host, "a")));
 }
 
 }  // namespace

