@@ -1,20 +1,19 @@
 // The daemon client proxy against a stand-in daemon on a real socket: the
 // messages it builds, how replies and transport failures reach handlers, the
-// synchronous helper, error decoding, and the test peer's client modes.
+// synchronous helper and error decoding.
 
 #include "client/VTDaemonClient.h"
 
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 
 #include <condition_variable>
 #include <cstdlib>
 #include <deque>
 #include <thread>
+#include <utility>
 
 #include "base/Log.h"
 #include "lmo/Listener.h"
-#include "tests/support/PeerProcess.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::client {
@@ -29,6 +28,28 @@ using lmo::Value;
 Value u(uint64_t v) {
   return Value::unsignedInteger(v);
 }
+
+// Items added on one thread and awaited on another.
+template <class T>
+class Recorded {
+ public:
+  void add(T item) {
+    std::lock_guard lock(mutex_);
+    items_.push_back(std::move(item));
+    changed_.notify_all();
+  }
+  // The items so far, once there are at least count (10 s at most).
+  std::vector<T> waitFor(size_t count) {
+    std::unique_lock lock(mutex_);
+    changed_.wait_for(lock, 10s, [&] { return items_.size() >= count; });
+    return items_;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<T> items_;  // Guarded by mutex_.
+};
 
 // What the stand-in daemon does with a request: reply with body, close the
 // connection, or keep the request unanswered until answerHeld().
@@ -63,12 +84,7 @@ class FakeDaemon {
     std::lock_guard lock(state_->mutex);
     state_->script.insert(state_->script.end(), entries.begin(), entries.end());
   }
-  // The requests received so far, once there are at least count (10 s at most).
-  std::vector<Dictionary> received(size_t count) {
-    std::unique_lock lock(state_->mutex);
-    state_->changed.wait_for(lock, 10s, [&] { return state_->received.size() >= count; });
-    return state_->received;
-  }
+  std::vector<Dictionary> received(size_t count) { return state_->received.waitFor(count); }
   void answerHeld(const Dictionary& body) {
     std::lock_guard lock(state_->mutex);
     for (auto& [connection, reply] : state_->held) {
@@ -80,10 +96,9 @@ class FakeDaemon {
 
  private:
   struct State {
+    Recorded<Dictionary> received;
     std::mutex mutex;
-    std::condition_variable changed;
-    // All guarded by mutex.
-    std::vector<Dictionary> received;
+    // Guarded by mutex.
     std::deque<Scripted> script;
     std::vector<std::shared_ptr<lmo::Connection>> connections;
     std::vector<std::pair<std::shared_ptr<lmo::Connection>, lmo::Reply>> held;
@@ -92,8 +107,7 @@ class FakeDaemon {
       const lmo::IncomingMessage* m = e.message();
       if (c == nullptr || m == nullptr) return;
       std::lock_guard lock(mutex);
-      received.push_back(m->body());
-      changed.notify_all();
+      received.add(m->body());
       Scripted next;
       if (!script.empty()) {
         next = script.front();
@@ -101,43 +115,23 @@ class FakeDaemon {
       }
       lmo::Reply reply = createReply(*m).value();
       reply.body = next.body;
-      switch (next.answer) {
-        case Answer::kClose:
-          return c->cancel();
-        case Answer::kHold:
-          held.emplace_back(c, reply);
-          return;
-        case Answer::kReply:
-          (void)c->sendReply(reply);
-      }
+      if (next.answer == Answer::kClose) return c->cancel();
+      if (next.answer == Answer::kHold) return (void)held.emplace_back(c, reply);
+      (void)c->sendReply(reply);
     }
   };
   std::shared_ptr<State> state_ = std::make_shared<State>();
   std::shared_ptr<lmo::Listener> listener_;
 };
 
-// Handler calls, and how many ran anywhere but on the expected queue.
-struct Replies {
-  std::mutex mutex;
-  std::condition_variable changed;
-  std::vector<Event> events;  // Guarded by mutex.
-  size_t offQueue = 0;        // Guarded by mutex.
-
-  std::vector<Event> waitFor(size_t count) {
-    std::unique_lock lock(mutex);
-    changed.wait_for(lock, 10s, [&] { return events.size() >= count; });
-    return events;
-  }
-};
+// Handler calls, each with whether it ran on the expected queue.
+using Replies = Recorded<std::pair<Event, bool>>;
 
 VTDaemonClient::ReplyHandler recordInto(const std::shared_ptr<Replies>& replies,
                                         const lmo::QueuePtr& queue) {
   const base::SerialQueue* expected = queue.get();  // compared, never dereferenced
   return [replies, expected](const Event& e) {
-    std::lock_guard lock(replies->mutex);
-    replies->events.push_back(e);
-    if (base::SerialQueue::current() != expected) ++replies->offQueue;
-    replies->changed.notify_all();
+    replies->add({e, base::SerialQueue::current() == expected});
   };
 }
 
@@ -154,29 +148,25 @@ TEST(VTDaemonClient, EveryRequestSendsExactlyItsMessage) {
   ::unsetenv("VANTREL_RUNTIME_DIR");
 
   const base::Uuid a = base::Uuid::random(), b = base::Uuid::random();
+  const std::vector<base::Uuid> ab{a, b}, ba{b, a};
   const Dictionary rules{{"QXExtensionPoint", "com.x.share"},
                          {"nested", Dictionary{{"list", Array{u(1), "two"}}}}};
   const Dictionary annotations{{"election", u(1)}};
   const std::vector<std::string> list{"/A.app/PlugIns/x.qxt", "/B"};
   const Array paths{"/A.app/PlugIns/x.qxt", "/B"};
-  using Op = std::function<base::Result<void>(VTDaemonClient::ReplyHandler)>;
-  const std::vector<std::pair<Op, Dictionary>> cases = {
+  const std::vector<std::pair<VTDaemonClient::RequestStarter, Dictionary>> cases = {
       {[&](auto h) { return client->addPlugIns(list, h); }, {{"request", "add"}, {"paths", paths}}},
       {[&](auto h) { return client->removePlugIns({}, h); },
        {{"request", "remove"}, {"paths", Array{}}}},
       {[&](auto h) { return client->bulkPlugins(0x8000000000000001, h); },
        {{"request", "bulk"}, {"flags", u(0x8000000000000001)}}},
-      {[&](auto h) {
-         return client->readyPlugIns({b, a}, 2, h);
-       },
+      {[&](auto h) { return client->readyPlugIns(ba, 2, h); },
        {{"request", "ready"}, {"flags", u(2)}, {"uuids", Array{b, a}}}},
       {[&](auto h) { return client->accessPlugIns({a}, 0, h); },
        {{"request", "access"}, {"flags", u(0)}, {"uuids", Array{a}}}},
       {[&](auto h) { return client->matchPlugIns(rules, 4, h); },
        {{"request", "match"}, {"rules", rules}, {"flags", u(4)}}},
-      {[&](auto h) {
-         return client->setPluginAnnotations({a, b}, annotations, h);
-       },
+      {[&](auto h) { return client->setPluginAnnotations(ab, annotations, h); },
        {{"request", "annotate"}, {"uuids", Array{a, b}}, {"annotations", annotations}}},
       {[&](auto h) { return client->holdPlugins(list, 1, h); },
        {{"request", "lock"}, {"paths", paths}, {"flags", u(1)}}},
@@ -213,9 +203,7 @@ TEST(VTDaemonClient, ProtocolVersionGovernsMessagesAndConversions) {
 }
 
 TEST(VTDaemonClient, ErrorInReplyDecodesEveryReplyShape) {
-  const auto error = [](int64_t code, const char* text) {
-    return base::error_with_code(code, text);
-  };
+  const auto error = static_cast<base::Error (*)(int64_t, const char*)>(base::error_with_code);
   const std::vector<std::pair<Event, std::optional<base::Error>>> cases = {
       {replyWith({}), std::nullopt},
       {replyWith({{"matches", Array{}}, {"errorcode", u(0)}}), std::nullopt},
@@ -266,14 +254,11 @@ TEST(VTDaemonClient, EachHandlerRunsOnceOnTheReplyQueue) {
   const auto events = replies->waitFor(3);
   ASSERT_EQ(events.size(), 3u);
   queue->sync([] {});  // anything queued before now has run
-  {
-    std::lock_guard lock(replies->mutex);
-    EXPECT_EQ(replies->events.size(), 3u);
-    EXPECT_EQ(replies->offQueue, 0u);
-  }
-  EXPECT_EQ(events[0].message()->body(), Dictionary({{"matches", Array{}}}));
+  EXPECT_EQ(replies->waitFor(0).size(), 3u);
+  for (const auto& [event, onQueue] : events) EXPECT_TRUE(onQueue) << describe(event);
+  EXPECT_EQ(events[0].first.message()->body(), Dictionary({{"matches", Array{}}}));
   for (size_t i : {1, 2}) {
-    EXPECT_EQ(VTDaemonClient::errorInReply(events[i]),
+    EXPECT_EQ(VTDaemonClient::errorInReply(events[i].first),
               base::error_with_code(4, "connection invalid"));
   }
   EXPECT_EQ(log.count(ended), 1u);
@@ -290,7 +275,7 @@ TEST(VTDaemonClient, EachHandlerRunsOnceOnTheReplyQueue) {
     daemon.answerHeld({});
     const auto late = pending->waitFor(1);
     ASSERT_EQ(late.size(), 1u) << name;
-    EXPECT_EQ(late[0].error(), lmo::ErrorEvent::kConnectionInvalid) << name;
+    EXPECT_EQ(late[0].first.error(), lmo::ErrorEvent::kConnectionInvalid) << name;
   }
 }
 
@@ -310,45 +295,6 @@ TEST(VTDaemonClient, SendSyncWaitsForItsOwnReplyOrGivesUp) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(client->replyQueue()->sync([&] { (void)client->sendSync({}, 10s); }),
                "sendSync on the reply queue would wait for its own reply");
-}
-
-TEST(VTDaemonClient, TestPeerConnectsAndHolds) {
-  testing::TempDir dir;
-  const std::string svc = dir.file("svc");
-  FakeDaemon daemon(svc);
-  const base::Uuid token = base::Uuid::random();
-  daemon.script({{Answer::kReply, {}},
-                 {Answer::kReply, {{"uuids", token}}},
-                 {Answer::kReply, {{"errorcode", u(14)}, {"error", "plug-ins are busy"}}}});
-  struct Case {
-    std::vector<std::string> args;
-    std::string line;
-    Dictionary sent;  // empty: nothing reaches the daemon
-    int exitStatus;
-  };
-  const Dictionary hold{
-      {"request", "lock"}, {"version", u(3)}, {"paths", Array{"/a", "/b"}}, {"flags", u(1)}};
-  const std::vector<Case> cases = {
-      {{"connect", svc},
-       "connected",
-       {{"request", "annotate"}, {"version", u(3)}, {"annotations", Dictionary{}}},
-       0},
-      {{"hold", svc, "1", "/a", "/b"}, "held " + token.string(), hold, 0},
-      {{"hold", svc, "1", "/a", "/b"}, "error 14 plug-ins are busy", hold, 0},
-      {{"hold", dir.file("nobody"), "1"}, "error 4 connection invalid", {}, 1},
-  };
-  size_t requests = 0;
-  for (const Case& c : cases) {
-    auto peer = vantrel::testing::PeerProcess::start(vantrel::testing::testPeerPath(), c.args);
-    ASSERT_NE(peer, nullptr);
-    EXPECT_EQ(peer->readLine(), c.line) << c.args[0];
-    if (!c.sent.empty()) {
-      EXPECT_EQ(daemon.received(++requests).back(), c.sent);
-    }
-    peer->closeStdin();
-    const int status = peer->wait();
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == c.exitStatus) << c.line;
-  }
 }
 
 }  // namespace

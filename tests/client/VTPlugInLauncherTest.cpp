@@ -3,16 +3,15 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <linux/landlock.h>
-#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -34,18 +33,16 @@ bool landlockAvailable() {
 
 // The lines a finished child wrote to fd, which is then closed.
 std::vector<std::string> readLines(int fd) {
-  std::string text;
-  char buffer[4096];
-  for (ssize_t n; (n = ::read(fd, buffer, sizeof buffer)) != 0;) {
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) break;
-    text.append(buffer, static_cast<size_t>(n));
-  }
-  ::close(fd);
+  FILE* in = ::fdopen(fd, "r");
+  if (in == nullptr) return {"(fdopen: " + std::to_string(errno) + ")"};
   std::vector<std::string> lines;
-  for (size_t at = 0, end; (end = text.find('\n', at)) != std::string::npos; at = end + 1) {
-    lines.push_back(text.substr(at, end - at));
+  char* line = nullptr;
+  size_t capacity = 0;
+  for (ssize_t n; (n = ::getline(&line, &capacity, in)) > 0;) {
+    lines.emplace_back(line, n - (line[n - 1] == '\n'));
   }
+  std::free(line);
+  std::fclose(in);
   return lines;
 }
 
@@ -62,30 +59,24 @@ class VTPlugInLauncherTest : public ::testing::Test {
   void TearDown() override {
     manager_.reset();
     ::close(selfPidfd_);
-    if (previous_) {
-      ::setenv(kVariable, previous_->c_str(), 1);
-    } else {
-      ::unsetenv(kVariable);
-    }
+    previous_ ? ::setenv(kVariable, previous_->c_str(), 1) : ::unsetenv(kVariable);
   }
 
-  base::Result<void> enable(const char* id, lmo::Dictionary environment, const char* profile,
-                            std::string executable = VANTREL_ENV_REPORTER_PATH, pid_t host = 0,
-                            int hostPidfd = -1) {
-    const lmo::Dictionary service{{"EnvironmentVariables", std::move(environment)},
+  // Enables id for this process (or for host) with the environment, which
+  // also names its data container (HOME), under profile.
+  base::Result<void> enable(const char* id, const lmo::Dictionary& environment, const char* profile,
+                            std::string executable = VANTREL_ENV_REPORTER_PATH,
+                            const testing::PeerProcess* host = nullptr) {
+    const lmo::Dictionary service{{"EnvironmentVariables", environment},
                                   {"_SandboxProfile", profile}};
-    // The tests' data container is what they set as HOME.
-    platform::ExternalServiceRegistration registration{
-        id, "1", host != 0 ? host : ::getpid(), std::move(executable),
-        lmo::Dictionary{{"LMOService", service}}};
-    if (const std::string* home = service.get("EnvironmentVariables")
-                                      .getIfDictionary()
-                                      ->get("HOME")
-                                      .getIfString()) {
+    platform::ExternalServiceRegistration registration{id, "1", host ? host->pid() : ::getpid(),
+                                                       std::move(executable),
+                                                       lmo::Dictionary{{"LMOService", service}}};
+    if (const std::string* home = environment.get("HOME").getIfString()) {
       registration.dataContainer = *home;
     }
     return manager_->registerExternalService(std::move(registration),
-                                             host != 0 ? hostPidfd : selfPidfd_);
+                                             host ? host->pidfd() : selfPidfd_);
   }
 
   std::string descriptionPath(const char* id) const {
@@ -169,61 +160,39 @@ TEST_F(VTPlugInLauncherTest, RefusesWhatItCannotStartAndLeavesNoChildBehind) {
       testing::PeerProcess::start(testing::testPeerPath(), {"sleep"});
   ASSERT_TRUE(other && other->readLine() == "ready");
 
+  ASSERT_TRUE(enable("com.example.theirs", {}, "plugin", copied, other.get()).has_value());
+  for (const char* id : {"com.example.gw", "com.example.bad", "com.example.out"}) {
+    ASSERT_TRUE(enable(id, {}, "plugin").has_value());
+  }
+  ASSERT_TRUE(enable("com.example.gone", {{"HOME", container}}, "plugin", copied).has_value());
+  ASSERT_TRUE(
+      enable("com.example.nowhere", {{"HOME", container + "/none"}}, "keyboard").has_value());
+  fs::permissions(descriptionPath("com.example.gw"), fs::perms::group_write, fs::perm_options::add);
+  ASSERT_TRUE(platform::writeFileAtomically(descriptionPath("com.example.bad"), "<plist", 0600)
+                  .has_value());
+  fs::remove(copied);
+
   struct Case {
     const char* name;
-    std::function<void()> prepare;
     const char* id;
     int standardOutput;
     const char* domain;
     int64_t code;
   };
+  const char* const kLauncher = kPlugInLauncherErrorDomain;
+  const char* const kPosix = platform::kPosixErrorDomain;
   const Case cases[] = {
-      {"never enabled", [] {}, "com.example.absent", -1, kPlugInLauncherErrorDomain,
-       kLaunchNotEnabled},
-      {"enabled for another process",
-       [&] {
-         ASSERT_TRUE(
-             enable("com.example.theirs", {}, "plugin", copied, other->pid(), other->pidfd())
-                 .has_value());
-       },
-       "com.example.theirs", -1, kPlugInLauncherErrorDomain, kLaunchNotEnabled},
-      {"not a file name", [] {}, "a/b", -1, platform::kPosixErrorDomain, EINVAL},
-      {"writable by the group",
-       [&] {
-         ASSERT_TRUE(enable("com.example.gw", {}, "plugin").has_value());
-         fs::permissions(descriptionPath("com.example.gw"), fs::perms::group_write,
-                         fs::perm_options::add);
-       },
-       "com.example.gw", -1, kPlugInLauncherErrorDomain, kLaunchUntrustedDescription},
-      {"not a property list",
-       [&] {
-         ASSERT_TRUE(enable("com.example.bad", {}, "plugin").has_value());
-         ASSERT_TRUE(
-             platform::writeFileAtomically(descriptionPath("com.example.bad"), "<plist", 0600)
-                 .has_value());
-       },
-       "com.example.bad", -1, kPlugInLauncherErrorDomain, kLaunchMalformedDescription},
-      {"executable gone",
-       [&] {
-         ASSERT_TRUE(
-             enable("com.example.gone", lmo::Dictionary{{"HOME", container}}, "plugin", copied)
-                 .has_value());
-         fs::remove(copied);
-       },
-       "com.example.gone", -1, platform::kPosixErrorDomain, ENOENT},
-      {"working directory gone",
-       [&] {
-         ASSERT_TRUE(enable("com.example.nowhere", lmo::Dictionary{{"HOME", container + "/none"}},
-                            "keyboard")
-                         .has_value());
-       },
-       "com.example.nowhere", -1, platform::kPosixErrorDomain, ENOENT},
-      {"closed output", [&] { ASSERT_TRUE(enable("com.example.out", {}, "plugin").has_value()); },
-       "com.example.out", 1000, platform::kPosixErrorDomain, EBADF},
+      {"never enabled", "com.example.absent", -1, kLauncher, kLaunchNotEnabled},
+      {"enabled for another process", "com.example.theirs", -1, kLauncher, kLaunchNotEnabled},
+      {"not a file name", "a/b", -1, kPosix, EINVAL},
+      {"writable by the group", "com.example.gw", -1, kLauncher, kLaunchUntrustedDescription},
+      {"not a property list", "com.example.bad", -1, kLauncher, kLaunchMalformedDescription},
+      {"executable gone", "com.example.gone", -1, kPosix, ENOENT},
+      {"working directory gone", "com.example.nowhere", -1, kPosix, ENOENT},
+      {"closed output", "com.example.out", 1000, kPosix, EBADF},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    c.prepare();
     base::Result<pid_t> pid = VTPlugInLauncher::launch(c.id, {.standardOutput = c.standardOutput});
     ASSERT_FALSE(pid.has_value());
     EXPECT_EQ(pid.error().domain, c.domain);

@@ -20,11 +20,7 @@ using Annotate = DaemonTest;
 
 TEST_F(Annotate, MalformedChangesTouchNothing) {
   const Value uuids = Array{uuidOf("widget")};
-  struct Case {
-    Value annotations;
-    Expected expected;
-  };
-  const Case cases[] = {
+  const std::pair<Value, Expected> cases[] = {
       {Value(), {4, "invalid request format (bad annotations dictionary)"}},
       {Array{}, {4, "invalid request format (bad annotations dictionary)"}},
       {Dictionary{{"election", "1"}}, {4, "invalid request format (annotation election)"}},
@@ -32,10 +28,9 @@ TEST_F(Annotate, MalformedChangesTouchNothing) {
       {Dictionary{{"election", "1"}, {"extension", Array{}}},
        {4, "invalid request format (annotation election)"}},
   };
-  for (const Case& c : cases) {
-    Dictionary extras{{"uuids", uuids}};
-    if (!c.annotations.isNull()) extras = extras.setting("annotations", c.annotations);
-    EXPECT_EQ(errorOf(request("annotate", extras)), c.expected) << lmo::describe(c.annotations);
+  for (const auto& [annotations, expected] : cases) {
+    const Dictionary extras = Dictionary{{"uuids", uuids}}.setting("annotations", annotations);
+    EXPECT_EQ(errorOf(request("annotate", extras)), expected) << lmo::describe(annotations);
   }
   // A change without a known key succeeds without looking at "uuids".
   EXPECT_EQ(errorOf(request("annotate", {{"annotations", Dictionary{{"colour", "red"}}},

@@ -1,5 +1,5 @@
-// Client objects: the peer's identity and entitlements, the server's
-// logging by verbosity, request counting, and the end of a client.
+// Client objects: the peer's identity and entitlements, request counting,
+// and the end of a client.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -18,7 +18,6 @@ namespace vantrel::daemon::testing {
 namespace {
 
 using namespace std::chrono_literals;
-using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
 
@@ -77,24 +76,6 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
   EXPECT_TRUE(client->description().ends_with(" NO CONNECTION>"));
 }
 
-TEST_F(ClientConnection, VerbosityDecidesWhatIsLogged) {
-  const std::string pid = std::to_string(::getpid());
-  struct Case {
-    uint32_t verbose;
-    bool debugLines;
-    bool dumps;
-  };
-  for (const Case c : {Case{0, false, false}, Case{1, true, false}, Case{2, true, true}}) {
-    server_->setVerbose(c.verbose);
-    base::LogCapture log;
-    request("bulk");
-    EXPECT_EQ(log.count("client " + pid + " request bulk"), c.debugLines ? 1u : 0u) << c.verbose;
-    EXPECT_EQ(log.contains("incoming request "), c.dumps) << c.verbose;
-    EXPECT_EQ(log.contains("Replying "), c.dumps) << c.verbose;
-    EXPECT_EQ(log.count("bulk options 0x0 not supported"), 1u) << c.verbose;
-  }
-}
-
 TEST_F(ClientConnection, EveryThousandthRequestIsReported) {
   server_->setVerbose(1);
   const std::string line = "client " + std::to_string(::getpid()) + " used 1000 requests so far";
@@ -105,37 +86,6 @@ TEST_F(ClientConnection, EveryThousandthRequestIsReported) {
   request("annotate", {{"annotations", Dictionary{}}}, connection);
   request("annotate", {{"annotations", Dictionary{}}}, connection);
   EXPECT_EQ(log.count(line), 1u);
-}
-
-TEST_F(ClientConnection, ADeadClientsHoldsGoBeforeItIsDeclaredDead) {
-  server_->setVerbose(1);
-  base::LogCapture log;
-  auto connection = connect();
-  request("lock", {{"flags", Value::unsignedInteger(2)}, {"paths", Array{plugInPath("widget")}}},
-          connection);
-  // A request queued behind a blocked service queue reaches it only after
-  // the client is dead: it must then do nothing, not even reply.
-  std::promise<void> release;
-  std::shared_future<void> released = release.get_future().share();
-  server_->submitWork([released] { released.wait(); });
-  (void)connection->send(Dictionary{{"request", "annotate"},
-                                    {"version", Value::unsignedInteger(3)},
-                                    {"uuids", Array{uuidOf("share")}},
-                                    {"annotations", Dictionary{{"election", Value::integer(1)}}}});
-  connection->cancel();
-  const std::string dead = "client " + std::to_string(::getpid()) + " is dead";
-  ASSERT_TRUE(eventually([&] { return log.count(dead) == 1; }));
-  release.set_value();
-  server_->mainQueue()->sync([] {});
-  EXPECT_EQ(server_->annotationForPlugIn(*plugIn("share")), std::nullopt);
-  const auto lines = log.lines();
-  const auto releasedAt = std::find_if(lines.begin(), lines.end(), [](const std::string& l) {
-    return l.starts_with("releasing plug-in hold ");
-  });
-  const auto deadAt = std::find(lines.begin(), lines.end(), dead);
-  ASSERT_NE(releasedAt, lines.end());
-  EXPECT_LT(releasedAt, deadAt);
-  EXPECT_TRUE(server_->holds().empty());
 }
 
 }  // namespace

@@ -42,17 +42,13 @@ using lmo::FrameKind;
 using lmo::Value;
 using vantrel::testing::PeerProcess;
 
-constexpr const char* kUsage = "Usage: vantreld [-S servicename] [-v]\n";
 constexpr auto kDeadline = 10s;
-constexpr uint64_t kUnrecognizedRequest = 4;
-constexpr uint64_t kVersionMismatch = 7;
 
 // Polls until condition holds or the deadline passes; whether it held.
 bool eventually(const std::function<bool()>& condition) {
   const auto deadline = std::chrono::steady_clock::now() + kDeadline;
-  while (!condition()) {
+  for (; !condition(); std::this_thread::sleep_for(10ms)) {
     if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(10ms);
   }
   return true;
 }
@@ -61,27 +57,20 @@ bool eventually(const std::function<bool()>& condition) {
 std::string readFile(const std::string& path) {
   std::error_code ec;
   if (!std::filesystem::is_regular_file(path, ec)) return "(not a regular file)";
-  std::ifstream in(path, std::ios::binary);
   std::ostringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
 
-// The complete lines of a log file (a line still being written is left out).
-std::vector<std::string> logLines(const std::string& path) {
+// The complete lines of a log file that begin with prefix (a line still being
+// written is left out).
+std::vector<std::string> logLines(const std::string& path, std::string_view prefix = "") {
   std::vector<std::string> lines;
-  const std::string text = readFile(path);
-  size_t start = 0;
-  for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
-    lines.push_back(text.substr(start, end - start));
+  std::istringstream in(readFile(path));
+  for (std::string line; std::getline(in, line) && !in.eof();) {
+    if (line.starts_with(prefix)) lines.push_back(line);
   }
   return lines;
-}
-
-size_t countLines(const std::string& path, const std::string& prefix) {
-  size_t count = 0;
-  for (const std::string& line : logLines(path)) count += line.starts_with(prefix) ? 1 : 0;
-  return count;
 }
 
 // The child's wait status once it has exited within timeout; nullopt while
@@ -95,16 +84,6 @@ std::optional<int> exitStatus(PeerProcess& child, std::chrono::milliseconds time
   return child.wait();
 }
 
-bool isRunning(PeerProcess& child) {
-  return !exitStatus(child, 0ms).has_value();
-}
-
-void putBigEndian(Bytes& out, uint64_t value, int bytes) {
-  for (int shift = (bytes - 1) * 8; shift >= 0; shift -= 8) {
-    out.push_back(static_cast<uint8_t>(value >> shift));
-  }
-}
-
 struct RawHeader {
   uint8_t version = lmo::kFrameVersion;
   uint8_t kind = static_cast<uint8_t>(FrameKind::kRequest);
@@ -113,23 +92,26 @@ struct RawHeader {
   uint64_t inReplyTo = 0;
 };
 
+Bytes operator+(Bytes a, const Bytes& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
+
 // A frame written field by field, so that any field can be wrong; length
 // replaces the length prefix (otherwise header plus body).
 Bytes rawFrame(const RawHeader& h, const Bytes& body,
                std::optional<uint64_t> length = std::nullopt) {
   Bytes out;
-  putBigEndian(out, length.value_or(lmo::kFrameHeaderSize + body.size()), 4);
-  out.push_back(h.version);
-  out.push_back(h.kind);
-  putBigEndian(out, h.reserved, 2);
-  putBigEndian(out, h.id, 8);
-  putBigEndian(out, h.inReplyTo, 8);
-  out.insert(out.end(), body.begin(), body.end());
-  return out;
-}
-
-Bytes cbor(const Dictionary& body) {
-  return lmo::encodeCbor(Value(body)).value();
+  const auto put = [&out](uint64_t value, int bytes) {
+    while (bytes-- > 0) out.push_back(static_cast<uint8_t>(value >> (8 * bytes)));
+  };
+  put(length.value_or(lmo::kFrameHeaderSize + body.size()), 4);
+  put(h.version, 1);
+  put(h.kind, 1);
+  put(h.reserved, 2);
+  put(h.id, 8);
+  put(h.inReplyTo, 8);
+  return out + body;
 }
 
 // depth maps, each the only value of the one before: {"a": {"a": ... {}}}.
@@ -144,40 +126,52 @@ Dictionary request(const char* type, uint64_t version) {
   return {{"request", type}, {"version", Value::unsignedInteger(version)}};
 }
 
-// A plain socket to the daemon: frames (or garbage) out, frames back.
+Bytes cbor(const Dictionary& body) {
+  return lmo::encodeCbor(Value(body)).value();
+}
+
+sockaddr_un socketAddress(const std::string& path) {
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  path.copy(addr.sun_path, sizeof addr.sun_path - 1);
+  return addr;
+}
+
+// A socket bound to path, or -1. Inheritable: a child may be handed it.
+int bindSocket(const std::string& path) {
+  const sockaddr_un addr = socketAddress(path);
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  if (fd >= 0 && ::bind(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) == 0) return fd;
+  if (fd >= 0) ::close(fd);
+  return -1;
+}
+
+// A plain socket to the daemon: frames (or garbage) out, frames back. A read
+// gives up after kDeadline.
 class RawClient {
  public:
-  explicit RawClient(const std::string& path) {
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    if (path.size() >= sizeof addr.sun_path) return;
-    std::memcpy(addr.sun_path, path.data(), path.size());
-    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd_ >= 0 && ::connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) close();
+  explicit RawClient(const std::string& path)
+      : fd_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+    const sockaddr_un addr = socketAddress(path);
+    const timeval timeout{std::chrono::seconds(kDeadline).count(), 0};
+    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+    if (::connect(fd_, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) close();
   }
   ~RawClient() { close(); }
   RawClient(const RawClient&) = delete;
   RawClient& operator=(const RawClient&) = delete;
 
   bool connected() const { return fd_ >= 0; }
-
   bool write(const Bytes& bytes) {
-    for (size_t sent = 0; sent < bytes.size();) {
-      const ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) return false;
-      sent += static_cast<size_t>(n);
-    }
-    return true;
+    return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size());
   }
   bool send(FrameKind kind, uint64_t id, const Dictionary& body) {
     return write(lmo::encodeFrame({kind, id, 0, body}).value());
   }
 
   // The next frame; nullopt at end of stream, on a bad frame or when none
-  // comes within the deadline.
+  // comes in time.
   std::optional<lmo::Frame> readFrame() {
-    const auto deadline = std::chrono::steady_clock::now() + kDeadline;
     for (;;) {
       if (auto frame = reader_.next()) {
         if (frame->has_value()) return std::move(*frame).value();
@@ -185,25 +179,24 @@ class RawClient {
         return std::nullopt;
       }
       uint8_t buffer[4096];
-      const ssize_t n = receive(buffer, sizeof buffer, deadline);
+      const ssize_t n = receive(buffer, sizeof buffer);
       if (n <= 0) return std::nullopt;
       reader_.feed(buffer, static_cast<size_t>(n));
     }
   }
 
-  // Whether the daemon ends the connection (end of stream or reset) within
-  // the deadline without sending anything first.
+  // Whether the daemon ends the connection (end of stream or reset) in time
+  // without sending anything first.
   ::testing::AssertionResult closedByDaemon() {
-    const auto deadline = std::chrono::steady_clock::now() + kDeadline;
     uint8_t buffer[4096];
-    const ssize_t n = receive(buffer, sizeof buffer, deadline);
+    const ssize_t n = receive(buffer, sizeof buffer);
     if (n == 0 || (n < 0 && errno == ECONNRESET)) return ::testing::AssertionSuccess();
     if (n > 0) return ::testing::AssertionFailure() << "the daemon answered " << n << " bytes";
     return ::testing::AssertionFailure() << "connection still open: " << std::strerror(errno);
   }
 
-  // Whether the daemon has ended its side within the deadline (for a
-  // socket that no longer reads).
+  // Whether the daemon has ended its side in time (for a socket that no
+  // longer reads).
   bool hungUpByDaemon() {
     pollfd p{fd_, POLLHUP, 0};
     return eventually([&] { return ::poll(&p, 1, 0) == 1 && (p.revents & POLLHUP) != 0; });
@@ -216,39 +209,25 @@ class RawClient {
   }
 
  private:
-  // recv with a deadline: the byte count, 0 at end of stream, -1 with errno
-  // (ETIMEDOUT when nothing came).
-  ssize_t receive(uint8_t* buffer, size_t size, std::chrono::steady_clock::time_point deadline) {
-    for (;;) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      pollfd p{fd_, POLLIN, 0};
-      const int ready = left.count() > 0 ? ::poll(&p, 1, static_cast<int>(left.count())) : 0;
-      if (ready < 0 && errno == EINTR) continue;
-      if (ready <= 0) {
-        errno = ETIMEDOUT;
-        return -1;
-      }
-      const ssize_t n = ::recv(fd_, buffer, size, 0);
-      if (n < 0 && errno == EINTR) continue;
-      return n;
+  ssize_t receive(uint8_t* buffer, size_t size) {
+    ssize_t n;
+    while ((n = ::recv(fd_, buffer, size, 0)) < 0 && errno == EINTR) {
     }
+    return n;
   }
 
-  int fd_ = -1;
+  int fd_;
   lmo::FrameReader reader_;
 };
 
 // An unknown request type, answered with code 4: proof that the daemon
 // serves this connection, and a request that logs nothing at verbosity 0.
 ::testing::AssertionResult ping(RawClient& client, uint64_t id) {
-  if (!client.send(FrameKind::kRequest, id, request("ping", 3))) {
-    return ::testing::AssertionFailure() << "cannot send ping " << id;
-  }
-  const std::optional<lmo::Frame> reply = client.readFrame();
+  std::optional<lmo::Frame> reply;
+  if (client.send(FrameKind::kRequest, id, request("ping", 3))) reply = client.readFrame();
   if (!reply) return ::testing::AssertionFailure() << "no reply to ping " << id;
   if (reply->kind != FrameKind::kReply || reply->inReplyTo != id ||
-      reply->body.get("errorcode").getIfUInt64() != kUnrecognizedRequest) {
+      reply->body.get("errorcode").getIfUInt64() != 4u) {
     return ::testing::AssertionFailure() << "ping " << id << " got reply to " << reply->inReplyTo
                                          << ": " << lmo::describe(reply->body);
   }
@@ -257,33 +236,33 @@ class RawClient {
 
 struct Daemon {
   std::unique_ptr<PeerProcess> process;
-  std::string log;  // its standard error, hence its log lines
+  std::string log;                    // its standard error, hence its log lines
+  std::unique_ptr<RawClient> client;  // set by startServing: answered a first ping
 };
 
-// How a daemon is started, beyond its arguments.
-struct Launch {
-  std::vector<std::string> environment;  // on top of the fixture's
-  std::string prelude;                   // shell commands run before the exec
-  const char* shell = "/bin/sh";
-  std::string stderrPath;  // empty: a fresh log file
-};
+// Whether the daemon exits with code within the deadline.
+::testing::AssertionResult exitsWith(Daemon& daemon, int code) {
+  if (!daemon.process) return ::testing::AssertionFailure() << "not started";
+  const std::optional<int> status = exitStatus(*daemon.process, kDeadline);
+  if (!status) return ::testing::AssertionFailure() << "still running";
+  if (WIFEXITED(*status) && WEXITSTATUS(*status) == code) return ::testing::AssertionSuccess();
+  return ::testing::AssertionFailure() << "wait status " << *status << ", log:\n"
+                                       << readFile(daemon.log);
+}
 
-// SIGPIPE at its default action while it lives, so that a child started
-// meanwhile does not inherit an ignored one from whatever ran the tests.
-class DefaultSigpipe {
- public:
-  DefaultSigpipe() {
-    struct sigaction action {};
-    action.sa_handler = SIG_DFL;
-    ::sigaction(SIGPIPE, &action, &saved_);
-  }
-  ~DefaultSigpipe() { ::sigaction(SIGPIPE, &saved_, nullptr); }
-  DefaultSigpipe(const DefaultSigpipe&) = delete;
-  DefaultSigpipe& operator=(const DefaultSigpipe&) = delete;
-
- private:
-  struct sigaction saved_ {};
-};
+// A connection to socket once the daemon serves it; null (after a test
+// failure) when it exits first or does not serve in time.
+std::unique_ptr<RawClient> connectWhenUp(const std::string& socket, Daemon& daemon) {
+  if (!daemon.process) return nullptr;
+  std::unique_ptr<RawClient> client;
+  eventually([&] {
+    client = std::make_unique<RawClient>(socket);
+    return client->connected() || exitStatus(*daemon.process, 0ms).has_value();
+  });
+  if (client->connected()) return client;
+  ADD_FAILURE() << "not serving " << socket << "; its log:\n" << readFile(daemon.log);
+  return nullptr;
+}
 
 class VantreldProcess : public ::testing::Test {
  protected:
@@ -293,65 +272,48 @@ class VantreldProcess : public ::testing::Test {
     }
   }
 
-  // The daemon's environment: everything it may write or read points into
-  // the temporary directory, and its log goes to standard error.
-  std::vector<std::string> environment() const {
-    return {"VANTREL_RUNTIME_DIR=" + tmp_.file("run"),
-            "VANTREL_STATE_DIR=" + tmp_.file("state"),
-            "VANTREL_APP_DIRS=" + tmp_.file("apps"),
-            "VANTREL_PLUGIN_DIRS=" + tmp_.file("plugins"),
-            "VANTREL_PREFERENCES_DIR=" + tmp_.file("prefs"),
-            "VANTREL_SDK_DIRS=" + tmp_.file("sdks"),
-            "XDG_STATE_HOME=" + tmp_.file("xdg-state"),
-            "XDG_CONFIG_HOME=" + tmp_.file("xdg-config"),
-            "HOME=" + tmp_.file("home"),
-            "VANTREL_LOG=stderr",
-            "LISTEN_PID=",
-            "LISTEN_FDS="};
-  }
-
   // Starts vantreld with args through a shell that runs the prelude and
-  // sends the daemon's standard error to a file of its own (a pipe nobody
-  // drains could stall a chatty daemon). The shell execs the daemon, so the
-  // child's pid is the daemon's.
-  Daemon start(const std::vector<std::string>& args, const Launch& launch = {}) {
+  // sends the daemon's standard error to log (by default a fresh file: a
+  // pipe nobody drains could stall a chatty daemon). The shell execs the
+  // daemon, so the child's pid is the daemon's. Everything the daemon may
+  // write or read points into the temporary directory.
+  Daemon start(const std::vector<std::string>& args, const std::string& prelude = "",
+               std::string log = "") {
     Daemon daemon;
-    daemon.log = launch.stderrPath.empty()
-                     ? tmp_.file("vantreld-" + std::to_string(++started_) + ".log")
-                     : launch.stderrPath;
-    std::vector<std::string> shellArgs{"-c",
-                                       launch.prelude + "exec 2>\"$1\"; shift; exec \"$0\" \"$@\"",
+    daemon.log = log.empty() ? tmp_.file("vantreld-" + std::to_string(++started_) + ".log") : log;
+    std::vector<std::string> shellArgs{"-c", prelude + "exec 2>\"$1\"; shift; exec \"$0\" \"$@\"",
                                        VANTRELD_PATH, daemon.log};
     shellArgs.insert(shellArgs.end(), args.begin(), args.end());
-    std::vector<std::string> fullEnv = environment();
-    fullEnv.insert(fullEnv.end(), launch.environment.begin(), launch.environment.end());
-    DefaultSigpipe sigpipe;
-    daemon.process = PeerProcess::start(launch.shell, shellArgs, fullEnv);
-    EXPECT_NE(daemon.process, nullptr);
-    // Exits are watched through the pidfd.
-    if (daemon.process != nullptr) {
-      EXPECT_GE(daemon.process->pidfd(), 0);
+    std::vector<std::string> environment{"VANTREL_LOG=stderr", "LISTEN_PID=", "LISTEN_FDS="};
+    for (const std::string entry :
+         {"VANTREL_RUNTIME_DIR=run", "VANTREL_STATE_DIR=state", "VANTREL_APP_DIRS=apps",
+          "VANTREL_PLUGIN_DIRS=plugins", "VANTREL_PREFERENCES_DIR=prefs", "VANTREL_SDK_DIRS=sdks",
+          "XDG_STATE_HOME=xdg-state", "XDG_CONFIG_HOME=xdg-config", "HOME=home"}) {
+      const size_t value = entry.find('=') + 1;
+      environment.push_back(entry.substr(0, value) + tmp_.file(entry.substr(value)));
     }
+    // The child gets SIGPIPE at its default action even when whatever ran
+    // the tests ignores it: the daemon has to ignore it itself.
+    struct sigaction defaultAction {};
+    struct sigaction saved {};
+    defaultAction.sa_handler = SIG_DFL;
+    ::sigaction(SIGPIPE, &defaultAction, &saved);
+    // bash: dash takes only one-digit descriptors in redirections.
+    daemon.process = PeerProcess::start("/bin/bash", shellArgs, environment);
+    ::sigaction(SIGPIPE, &saved, nullptr);
+    // Exits are watched through the pidfd.
+    EXPECT_TRUE(daemon.process && daemon.process->pidfd() >= 0);
     return daemon;
   }
 
-  // A daemon on socket, answering a first ping. Fails the test (and
-  // returns a daemon that may not run) otherwise.
-  Daemon startServing(const std::string& socket, std::vector<std::string> extraArgs = {},
-                      const Launch& launch = {}) {
-    std::vector<std::string> args{"-S", socket, "-d", tmp_.file("Annotations")};
-    args.insert(args.end(), extraArgs.begin(), extraArgs.end());
-    Daemon daemon = start(args, launch);
-    if (daemon.process == nullptr) return daemon;
-    std::unique_ptr<RawClient> client;
-    const bool up = eventually([&] {
-      client = std::make_unique<RawClient>(socket);
-      return client->connected() || !isRunning(*daemon.process);
-    });
-    EXPECT_TRUE(up && client->connected()) << "not serving; its log:\n" << readFile(daemon.log);
-    if (client->connected()) {
-      EXPECT_TRUE(ping(*client, 1));
-    }
+  // A daemon on socket whose client has answered a first ping. Fails the
+  // test (and leaves client null) otherwise.
+  Daemon startServing(const std::string& socket, std::vector<std::string> args = {},
+                      const std::string& log = "") {
+    args.insert(args.begin(), {"-S", socket, "-d", tmp_.file("Annotations")});
+    Daemon daemon = start(args, "", log);
+    daemon.client = connectWhenUp(socket, daemon);
+    if (daemon.client && !ping(*daemon.client, 1)) daemon.client.reset();
     return daemon;
   }
 
@@ -363,135 +325,69 @@ class VantreldProcess : public ::testing::Test {
 };
 
 TEST_F(VantreldProcess, BadCommandLinePrintsUsageAndExits2) {
-  const std::vector<std::vector<std::string>> commandLines = {
-      {"-x"},                            // unknown option
-      {"-vx"},                           // unknown option in a cluster
-      {"-S"},                            // final -S without a name
-      {"-c"},                            // final -c without a number
-      {"-v", "-S", socket_, "operand"},  // operand after the options
-      {"operand", "-S", socket_},        // operand first
-  };
+  // An unknown option, alone and in a cluster; a final option without its
+  // value; an operand after the options and before them.
+  const std::vector<std::vector<std::string>> commandLines = {{"-x"},
+                                                              {"-vx"},
+                                                              {"-S"},
+                                                              {"-c"},
+                                                              {"-v", "-S", socket_, "operand"},
+                                                              {"operand", "-S", socket_}};
   for (const auto& args : commandLines) {
-    std::string shown;
-    for (const std::string& arg : args) shown += arg + " ";
-    SCOPED_TRACE(shown);
+    SCOPED_TRACE(::testing::PrintToString(args));
     Daemon daemon = start(args);
-    ASSERT_NE(daemon.process, nullptr);
-    const std::optional<int> status = exitStatus(*daemon.process, kDeadline);
-    ASSERT_TRUE(status.has_value()) << "still running";
-    EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 2) << "wait status " << *status;
-    EXPECT_EQ(readFile(daemon.log), kUsage);
+    EXPECT_TRUE(exitsWith(daemon, 2));
+    EXPECT_EQ(readFile(daemon.log), "Usage: vantreld [-S servicename] [-v]\n");
     EXPECT_FALSE(std::filesystem::exists(socket_));
   }
 }
 
 TEST_F(VantreldProcess, ReplacesAStaleSocketButNeverALiveOneOrAFile) {
   // A socket file whose listener is gone, as a killed daemon leaves it.
-  {
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::memcpy(addr.sun_path, socket_.data(), socket_.size());
-    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
-    ::close(fd);
-    ASSERT_TRUE(std::filesystem::is_socket(socket_));
-  }
+  const int stale = bindSocket(socket_);
+  ASSERT_GE(stale, 0);
+  ::close(stale);
   Daemon first = startServing(socket_);
-  ASSERT_TRUE(isRunning(*first.process));
+  ASSERT_TRUE(first.client);
   struct stat before {};
   ASSERT_EQ(::stat(socket_.c_str(), &before), 0);
   EXPECT_EQ(before.st_mode & 0777, 0666u);
 
-  // A second daemon on the live socket gives up and leaves it alone.
-  Daemon second = start({"-S", socket_, "-d", tmp_.file("Annotations2")});
-  ASSERT_NE(second.process, nullptr);
-  std::optional<int> status = exitStatus(*second.process, kDeadline);
-  ASSERT_TRUE(status.has_value()) << "the second daemon still runs";
-  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 1) << "wait status " << *status;
-  EXPECT_EQ(countLines(second.log, "unable to construct server"), 1u) << readFile(second.log);
+  // A daemon on the live socket, or on something that is no socket at all,
+  // gives up and leaves it alone.
+  const std::string file = tmp_.write("not-a-socket", "precious");
+  for (const std::string& taken : {socket_, file}) {
+    SCOPED_TRACE(taken);
+    Daemon other = start({"-S", taken, "-d", tmp_.file("Annotations2")});
+    EXPECT_TRUE(exitsWith(other, 1));
+    EXPECT_EQ(logLines(other.log, "unable to construct server").size(), 1u) << readFile(other.log);
+  }
+  EXPECT_EQ(readFile(file), "precious");
   struct stat after {};
   ASSERT_EQ(::stat(socket_.c_str(), &after), 0);
   EXPECT_EQ(after.st_ino, before.st_ino);
+  // Still served, by the first daemon: the others have exited.
   RawClient client(socket_);
-  ASSERT_TRUE(client.connected());
   EXPECT_TRUE(ping(client, 2));
-  EXPECT_TRUE(isRunning(*first.process));
-
-  // Something that is not a socket is never taken for a stale one.
-  const std::string file = tmp_.write("not-a-socket", "precious");
-  Daemon third = start({"-S", file});
-  ASSERT_NE(third.process, nullptr);
-  status = exitStatus(*third.process, kDeadline);
-  ASSERT_TRUE(status.has_value()) << "the daemon on a plain file still runs";
-  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 1) << "wait status " << *status;
-  EXPECT_EQ(countLines(third.log, "unable to construct server"), 1u) << readFile(third.log);
-  EXPECT_EQ(readFile(file), "precious");
 }
 
-TEST_F(VantreldProcess, RepliesToRequestsAndNotToMessages) {
+TEST_F(VantreldProcess, ServesWellFormedFramesAndDropsMalformedPeers) {
   Daemon daemon = startServing(socket_);
-  RawClient client(socket_);
-  ASSERT_TRUE(client.connected());
-
-  struct Case {
-    uint64_t version;
-    std::optional<uint64_t> errorcode;  // nullopt: an empty reply
-    const char* error;
-  };
-  const Case cases[] = {
-      {3, std::nullopt, nullptr},
-      {2, std::nullopt, nullptr},
-      {1, kVersionMismatch, "unsupported protocol version 1 (current 3)"},
-  };
-  uint64_t id = 100;
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.version);
-    ++id;
-    ASSERT_TRUE(client.send(FrameKind::kRequest, id, request("bulk", c.version)));
-    const std::optional<lmo::Frame> reply = client.readFrame();
-    ASSERT_TRUE(reply.has_value());
-    EXPECT_EQ(reply->kind, FrameKind::kReply);
-    EXPECT_EQ(reply->inReplyTo, id);
-    if (!c.errorcode) {
-      EXPECT_TRUE(reply->body.empty()) << lmo::describe(reply->body);
-    } else {
-      EXPECT_EQ(reply->body.get("errorcode").getIfUInt64(), c.errorcode);
-      EXPECT_EQ(reply->body.get("error"), Value(c.error));
-    }
-  }
-
-  // Messages that expect no reply get none, a failing one included. Requests
-  // are served in order, so the next frame must answer the request after them.
-  ASSERT_TRUE(client.send(FrameKind::kMessage, 201, request("bulk", 3)));
-  ASSERT_TRUE(client.send(FrameKind::kMessage, 202, request("bulk", 1)));
-  ASSERT_TRUE(client.send(FrameKind::kRequest, 203, request("bulk", 3)));
-  const std::optional<lmo::Frame> reply = client.readFrame();
-  ASSERT_TRUE(reply.has_value());
-  EXPECT_EQ(reply->inReplyTo, 203u);
-  EXPECT_TRUE(ping(client, 204));
-}
-
-TEST_F(VantreldProcess, DropsMalformedPeersAndKeepsServingOthers) {
-  Daemon daemon = startServing(socket_);
-  RawClient good(socket_);
-  ASSERT_TRUE(good.connected());
-  ASSERT_TRUE(ping(good, 1));
-
-  const Bytes wellFormed = cbor(request("ping", 3));
-  const Bytes valid = rawFrame({}, wellFormed);
-  RawHeader version2, kind4, reserved, idZero, requestWithReplyTo, strayReply;
-  version2.version = 2;
-  kind4.kind = 4;
-  reserved.reserved = 1;
-  idZero.id = 0;
-  requestWithReplyTo.inReplyTo = 5;
-  strayReply.kind = static_cast<uint8_t>(FrameKind::kReply);
-  strayReply.inReplyTo = 999;
-
+  ASSERT_TRUE(daemon.client);
+  const Bytes body = cbor(request("ping", 3));
+  const Bytes valid = rawFrame({}, body);
+  const uint8_t kMessage = static_cast<uint8_t>(FrameKind::kMessage);
+  const uint8_t kReply = static_cast<uint8_t>(FrameKind::kReply);
+  // Messages get no reply, a failing one included. Requests are served in
+  // order, so the first frame back must answer the request after them.
+  const Bytes messages =
+      rawFrame({.kind = kMessage, .id = 5},
+               cbor(request("annotate", 3).setting("annotations", Dictionary()))) +
+      rawFrame({.kind = kMessage, .id = 6}, cbor(request("ping", 1)));
   struct Case {
     const char* name;
     Bytes bytes;
-    const char* reason;  // a fragment of the logged reason; null: answered
+    const char* reason;  // a fragment of the logged reason; null: request 1 answered
     bool closeAfterWriting = false;
   };
   const Case cases[] = {
@@ -499,15 +395,17 @@ TEST_F(VantreldProcess, DropsMalformedPeersAndKeepsServingOthers) {
       // below fail for their one fault, not for the way they are built.
       {"well formed", valid, nullptr},
       {"nested exactly 64 deep", rawFrame({}, nestedMaps(lmo::kMaxCborDepth)), nullptr},
+      {"messages, then a request", messages + valid, nullptr},
       {"length above 16 MiB", rawFrame({}, {}, lmo::kMaxFrameLength + 1), "exceeds the limit"},
       {"length below the header", rawFrame({}, {}, lmo::kFrameHeaderSize - 1), "shorter"},
       {"truncated, then closed", Bytes(valid.begin(), valid.begin() + 10), "truncated", true},
-      {"unknown version", rawFrame(version2, wellFormed), "version"},
-      {"unknown kind", rawFrame(kind4, wellFormed), "kind"},
-      {"non-zero reserved field", rawFrame(reserved, wellFormed), "reserved"},
-      {"id 0", rawFrame(idZero, wellFormed), "id 0"},
-      {"request with an in-reply-to", rawFrame(requestWithReplyTo, wellFormed), "in-reply-to"},
-      {"reply to nothing sent", rawFrame(strayReply, wellFormed), "reply to unknown message"},
+      {"unknown version", rawFrame({.version = 2}, body), "version"},
+      {"unknown kind", rawFrame({.kind = 4}, body), "kind"},
+      {"non-zero reserved field", rawFrame({.reserved = 1}, body), "reserved"},
+      {"id 0", rawFrame({.id = 0}, body), "id 0"},
+      {"request with an in-reply-to", rawFrame({.inReplyTo = 5}, body), "in-reply-to"},
+      {"reply to nothing sent", rawFrame({.kind = kReply, .inReplyTo = 999}, body),
+       "reply to unknown message"},
       {"body is an array", rawFrame({}, {0x80}), "not a map"},
       {"nested 65 deep", rawFrame({}, nestedMaps(lmo::kMaxCborDepth + 1)), "deeper than 64"},
       {"unknown tag", rawFrame({}, {0xA1, 0x61, 'a', 0xD8, 0x63, 0x00}), "tag"},
@@ -521,7 +419,6 @@ TEST_F(VantreldProcess, DropsMalformedPeersAndKeepsServingOthers) {
     SCOPED_TRACE(c.name);
     const size_t linesBefore = logLines(daemon.log).size();
     RawClient bad(socket_);
-    ASSERT_TRUE(bad.connected());
     ASSERT_TRUE(bad.write(c.bytes));
     if (c.closeAfterWriting) bad.shutdown(SHUT_WR);
     if (c.reason == nullptr) {
@@ -532,8 +429,7 @@ TEST_F(VantreldProcess, DropsMalformedPeersAndKeepsServingOthers) {
       EXPECT_TRUE(bad.closedByDaemon());
       EXPECT_TRUE(eventually([&] { return logLines(daemon.log).size() > linesBefore; }));
     }
-    ASSERT_TRUE(isRunning(*daemon.process)) << readFile(daemon.log);
-    EXPECT_TRUE(ping(good, ++pingId));
+    ASSERT_TRUE(ping(*daemon.client, ++pingId)) << readFile(daemon.log);
     // Exactly one line for the bad peer, and none for a good one.
     const std::vector<std::string> lines = logLines(daemon.log);
     ASSERT_EQ(lines.size(), linesBefore + (c.reason ? 1 : 0)) << readFile(daemon.log);
@@ -546,118 +442,84 @@ TEST_F(VantreldProcess, DropsMalformedPeersAndKeepsServingOthers) {
 
 TEST_F(VantreldProcess, SurvivesBrokenPipes) {
   Daemon daemon = startServing(socket_);
-  enum class Leave { kClose, kStopReading };
   uint64_t id = 10;
-  for (Leave leave : {Leave::kClose, Leave::kStopReading}) {
-    SCOPED_TRACE(leave == Leave::kClose ? "closes" : "stops reading");
+  for (const bool stopReading : {false, true}) {
+    SCOPED_TRACE(stopReading ? "stops reading" : "closes");
     RawClient client(socket_);
-    ASSERT_TRUE(client.connected());
     ASSERT_TRUE(client.send(FrameKind::kRequest, ++id, request("bulk", 3)));
-    if (leave == Leave::kClose) {
-      client.close();
-    } else {
+    if (stopReading) {
       // The socket stays open but refuses input: the reply's write fails
       // with a broken pipe, and the daemon drops the connection.
       client.shutdown(SHUT_RD);
       EXPECT_TRUE(client.hungUpByDaemon());
+    } else {
+      client.close();
     }
     RawClient next(socket_);
-    ASSERT_TRUE(next.connected());
-    EXPECT_TRUE(ping(next, ++id));
-    ASSERT_TRUE(isRunning(*daemon.process)) << readFile(daemon.log);
+    ASSERT_TRUE(ping(next, ++id)) << readFile(daemon.log);
   }
   // A peer that leaves is no misbehaving peer.
-  EXPECT_EQ(countLines(daemon.log, "closing connection"), 0u) << readFile(daemon.log);
+  EXPECT_EQ(logLines(daemon.log, "closing connection").size(), 0u) << readFile(daemon.log);
 
   // The reader of its log goes away: the next log line ("bulk options ...")
   // is written into a broken pipe.
   const std::string fifo = tmp_.file("log.fifo");
   ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
-  int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  const int reader = ::open(fifo.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
   ASSERT_GE(reader, 0);
-  const std::string socket = tmp_.file("unlogged.socket");
-  Daemon unlogged = startServing(socket, {}, {.stderrPath = fifo});
+  Daemon unlogged = startServing(tmp_.file("unlogged.socket"), {}, fifo);
   ::close(reader);
-  RawClient client(socket);
-  ASSERT_TRUE(client.connected());
-  ASSERT_TRUE(client.send(FrameKind::kRequest, 1, request("bulk", 3)));
-  EXPECT_TRUE(client.readFrame().has_value());
-  EXPECT_TRUE(ping(client, 2));
-  EXPECT_TRUE(isRunning(*unlogged.process));
+  ASSERT_TRUE(unlogged.client);
+  ASSERT_TRUE(unlogged.client->send(FrameKind::kRequest, 2, request("bulk", 3)));
+  EXPECT_TRUE(unlogged.client->readFrame().has_value());
+  EXPECT_TRUE(ping(*unlogged.client, 3));
 }
 
 TEST_F(VantreldProcess, ServesTheSocketHandedOverByTheServiceManager) {
-  struct Case {
-    const char* name;
-    const char* listenPid;  // shell text for LISTEN_PID
-    bool served;            // whether the daemon takes descriptor 3
-  };
-  const Case cases[] = {
-      {"for this process", "$$", true},
-      {"for another process", "1", false},
-  };
-  int row = 0;
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.name);
-    ++row;
-    const std::string handed = tmp_.file("handed-" + std::to_string(row) + ".socket");
-    const std::string own = tmp_.file("own-" + std::to_string(row) + ".socket");
-    // Inherited on purpose: no close-on-exec. The shell moves it to 3.
-    int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::memcpy(addr.sun_path, handed.data(), handed.size());
-    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  // The daemon takes descriptor 3 only when LISTEN_PID (shell text) names it.
+  for (const std::string listenPid : {"$$", "1"}) {
+    SCOPED_TRACE("LISTEN_PID=" + listenPid);
+    const bool served = listenPid == "$$";
+    const std::string handed = tmp_.file("handed-" + std::to_string(served) + ".socket");
+    const std::string own = tmp_.file("own-" + std::to_string(served) + ".socket");
+    // Inherited on purpose; the shell moves it to 3.
+    const int fd = bindSocket(handed);
+    ASSERT_GE(fd, 0);
     ASSERT_EQ(::listen(fd, 16), 0);
     const std::string n = std::to_string(fd);
-    std::string prelude = fd == 3 ? "" : "exec 3<&" + n + " " + n + "<&-; ";
-    prelude += std::string("LISTEN_PID=") + c.listenPid + "; export LISTEN_PID; ";
-    // bash: dash takes only one-digit descriptors in redirections.
-    Daemon daemon =
-        start({"-S", own, "-d", tmp_.file("Annotations")},
-              {.environment = {"LISTEN_FDS=1"}, .prelude = prelude, .shell = "/bin/bash"});
+    const std::string prelude = (fd == 3 ? "" : "exec 3<&" + n + " " + n + "<&-; ") +
+                                "export LISTEN_FDS=1 LISTEN_PID=" + listenPid + "; ";
+    Daemon daemon = start({"-S", own, "-d", tmp_.file("Annotations")}, prelude);
     ::close(fd);
-    ASSERT_NE(daemon.process, nullptr);
-    const std::string& served = c.served ? handed : own;
-    std::unique_ptr<RawClient> client;
-    ASSERT_TRUE(eventually([&] {
-      client = std::make_unique<RawClient>(served);
-      return client->connected() || !isRunning(*daemon.process);
-    }));
-    ASSERT_TRUE(client->connected()) << readFile(daemon.log);
+    const std::unique_ptr<RawClient> client = connectWhenUp(served ? handed : own, daemon);
+    ASSERT_TRUE(client);
     EXPECT_TRUE(ping(*client, 1)) << readFile(daemon.log);
-    EXPECT_EQ(std::filesystem::exists(own), !c.served);
+    EXPECT_EQ(std::filesystem::exists(own), !served);
   }
 }
 
 TEST_F(VantreldProcess, VerbosityAddsDebugLinesThenDumps) {
   struct Case {
     std::vector<std::string> flags;
-    bool debugLines;
+    size_t debugLines;
     bool dumps;
   };
   const Case cases[] = {
-      {{}, false, false},
-      {{"-v"}, true, false},
-      {{"-vv"}, true, true},
-      {{"-v", "-v"}, true, true},
-  };
-  const std::string pid = std::to_string(::getpid());
+      {{}, 0, false}, {{"-v"}, 1, false}, {{"-vv"}, 1, true}, {{"-v", "-v"}, 1, true}};
+  const std::string requestLine = "client " + std::to_string(::getpid()) + " request bulk";
   int row = 0;
   for (const Case& c : cases) {
     SCOPED_TRACE(::testing::PrintToString(c.flags));
-    const std::string socket = tmp_.file("verbose-" + std::to_string(++row) + ".socket");
-    Daemon daemon = startServing(socket, c.flags);
-    RawClient client(socket);
-    ASSERT_TRUE(client.connected());
-    ASSERT_TRUE(client.send(FrameKind::kRequest, 7, request("bulk", 3)));
-    ASSERT_TRUE(client.readFrame().has_value());
+    Daemon daemon =
+        startServing(tmp_.file("verbose-" + std::to_string(++row) + ".socket"), c.flags);
+    ASSERT_TRUE(daemon.client);
+    ASSERT_TRUE(daemon.client->send(FrameKind::kRequest, 7, request("bulk", 3)));
+    ASSERT_TRUE(daemon.client->readFrame().has_value());
     // The lines of a request are written before its reply is sent.
-    const std::string log = daemon.log;
-    EXPECT_EQ(countLines(log, "client " + pid + " request bulk") != 0, c.debugLines)
-        << readFile(log);
-    EXPECT_EQ(countLines(log, "incoming request ") != 0, c.dumps) << readFile(log);
-    EXPECT_EQ(countLines(log, "Replying ") != 0, c.dumps) << readFile(log);
+    EXPECT_EQ(logLines(daemon.log, requestLine).size(), c.debugLines) << readFile(daemon.log);
+    EXPECT_EQ(logLines(daemon.log, "bulk options 0x0 not supported").size(), 1u);
+    EXPECT_NE(logLines(daemon.log, "incoming request ").empty(), c.dumps);
+    EXPECT_NE(logLines(daemon.log, "Replying ").empty(), c.dumps);
   }
 }
 
