@@ -17,8 +17,8 @@ using namespace std::chrono_literals;
 void DaemonTest::SetUp() {
   // Bound while the runtime directory is not yet this test's own.
   serviceManagerDirectory();
-  for (const char* name :
-       {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME", "VANTREL_PREFERENCES_DIR"}) {
+  for (const char* name : {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME",
+                           "VANTREL_PREFERENCES_DIR", "VANTREL_SYSTEM_DIR"}) {
     const char* value = std::getenv(name);
     savedEnvironment_[name] = value ? std::optional<std::string>(value) : std::nullopt;
   }
@@ -26,13 +26,15 @@ void DaemonTest::SetUp() {
   ::setenv("VANTREL_STATE_DIR", tmp_.file("state").c_str(), 1);
   ::setenv("XDG_STATE_HOME", tmp_.file("xdg").c_str(), 1);
   ::setenv("VANTREL_PREFERENCES_DIR", tmp_.file("prefs").c_str(), 1);
+  ::setenv("VANTREL_SYSTEM_DIR", tmp_.file("System").c_str(), 1);
 
   omnidex::testing::writeBundle(hostApp(), {{"KBBundleIdentifier", "com.x.host"}});
   writePlugIn("apps/Host.app/PlugIns/widget.appex", kWidget);
   writePlugIn("apps/Host.app/PlugIns/share.appex", kShare);
   omnidex::OmnidexConfig config;
   config.stateDirectory = tmp_.file("state");
-  config.applicationDirectories = {tmp_.file("apps")};
+  config.applicationDirectories = {tmp_.file("apps"), tmp_.file(kEarlyApps)};
+  config.plugInDirectories = {systemPlugIns()};
   auto registry = omnidex::Omnidex::open(config);
   ASSERT_TRUE(registry.has_value()) << registry.error().description();
   registry_ = registry.value();

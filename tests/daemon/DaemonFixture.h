@@ -24,6 +24,11 @@ namespace vantrel::daemon::testing {
 inline constexpr const char* kWidget = "com.x.widget";
 inline constexpr const char* kShare = "com.x.share";
 
+// A second applications directory, whose path sorts before the system
+// volume's while "apps" sorts after it: the registry visits plug-ins in path
+// order, and some rules depend on who comes first.
+inline constexpr const char* kEarlyApps = "Early";
+
 class DaemonTest : public ::testing::Test {
  protected:
   void SetUp() override;
@@ -35,6 +40,9 @@ class DaemonTest : public ::testing::Test {
   // Writes a plug-in bundle at the temporary-directory-relative path, with
   // the test peer installed as its executable; returns its absolute path.
   std::string writePlugIn(const std::string& relative, const std::string& identifier);
+  // The system volume's stand-alone plug-ins (the volume is
+  // VANTREL_SYSTEM_DIR, a directory of the test's own).
+  std::string systemPlugIns() const { return tmp_.file("System/Library/PlugIns"); }
   std::string hostApp() const { return tmp_.file("apps/Host.app"); }
   std::string plugInPath(const char* name) const {
     return hostApp() + "/PlugIns/" + name + ".appex";

@@ -1,25 +1,17 @@
-// Discovery and use of plug-ins end to end: "match" with its rules, filters
-// and duplicate resolution, host authorisation as "ready" reports it, the
-// launch descriptions "ready" leaves, and the read tokens of "access".
+// Discovery end to end: "match" with its rules, filters and duplicate
+// resolution, and host authorisation as "match" and "ready" report it.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
-#include <memory>
-#include <set>
+#include <thread>
 
 #include "base/Log.h"
 #include "platform/DeviceRestrictions.h"
 #include "platform/Preferences.h"
-#include "platform/PropertyList.h"
-#include "platform/SandboxExtensionService.h"
-#include "platform/ServiceManager.h"
 #include "registry/VTDUserPrefs.h"
-#include "tests/daemon/DaemonFixture.h"
-#include "tests/omnidex/OmnidexFixtures.h"
-#include "tests/support/PeerProcess.h"
+#include "tests/daemon/DiscoveryFixture.h"
 
 namespace vantrel::daemon::testing {
 namespace {
@@ -27,107 +19,10 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-using Ids = std::multiset<std::string>;
-using vantrel::testing::PeerProcess;
 
 constexpr const char* kManager = "com.karvo.private.vantrel.manager";
 constexpr const char* kAllowedPlugIns = "com.karvo.developer.vantrel.allowedplugins";
 constexpr uint64_t kDiscoverAll = 0x200;
-
-class Discovery : public DaemonTest {
- protected:
-  // Writes <apps>/<app>.app/PlugIns/<identifier>.appex with those extension
-  // attributes and extension keys (without an executable unless
-  // withExecutable), top-level Info keys and, when not empty, a trusted (root's,
-  // 0644) Entitlements.plist; rescans; returns the bundle's path.
-  std::string addPlugIn(const std::string& app, const std::string& identifier,
-                        const Dictionary& attributes = {}, Dictionary extension = {},
-                        const Dictionary& entitlements = {}, const Dictionary& top = {},
-                        bool withExecutable = true) {
-    const std::string appPath = tmp_.file("apps/" + app + ".app");
-    omnidex::testing::writeBundle(appPath, {{"KBBundleIdentifier", "com.app." + app}});
-    Dictionary info = plugInInfo(identifier);
-    if (!withExecutable) info = info.removing("KBBundleExecutable");
-    for (const auto& [key, value] : top) info = info.setting(key, value);
-    for (const auto& [key, value] : *info.get("QXExtension").getIfDictionary()) {
-      if (!extension.contains(key)) extension = extension.setting(key, value);
-    }
-    info = info.setting("QXExtension", extension.setting("QXExtensionAttributes", attributes));
-    const std::string path =
-        omnidex::testing::writeBundle(appPath + "/PlugIns/" + identifier + ".appex", info);
-    if (withExecutable) {
-      EXPECT_TRUE(vantrel::testing::installTestPeer(path + "/peer"));
-    }
-    if (!entitlements.empty()) {
-      EXPECT_TRUE(
-          platform::writePropertyListFile(path + "/Entitlements.plist", Value(entitlements), 0644)
-              .has_value());
-    }
-    registry_->reconcile();
-    EXPECT_TRUE(eventually([&] {
-      return server_->findPlugInAtPath(model::FileUrl::fromPath(path)) != nullptr;
-    })) << path;
-    return path;
-  }
-  base::Uuid uuidAt(const std::string& path) const {
-    return *server_->findPlugInAtPath(model::FileUrl::fromPath(path))->uuid();
-  }
-
-  Array matches(const Dictionary& extras) {
-    const Dictionary reply = request("match", extras);
-    const Array* forms = reply.get("matches").getIfArray();
-    EXPECT_NE(forms, nullptr) << lmo::describe(reply);
-    return forms ? *forms : Array{};
-  }
-  Ids matching(const Dictionary& rules, uint64_t flags = 0) {
-    Ids ids;
-    for (const Value& form : matches({{"rules", rules}, {"flags", u64(flags)}})) {
-      ids.insert(*form.getIfDictionary()->get("identifier").getIfString());
-    }
-    return ids;
-  }
-  static Dictionary formOf(const Array& forms, const std::string& identifier) {
-    for (const Value& form : forms) {
-      if (form.getIfDictionary()->get("identifier") == Value(identifier)) {
-        return *form.getIfDictionary();
-      }
-    }
-    ADD_FAILURE() << "no form for " << identifier;
-    return {};
-  }
-
-  // A test peer in a bundle of its own with those entitlements.
-  std::string peerWith(const std::string& name, const Dictionary& entitlements) {
-    const std::string bundle = tmp_.file("Tools/" + name + ".app");
-    omnidex::testing::writeBundle(
-        bundle, {{"KBBundleIdentifier", "com.peer." + name}, {"KBBundleExecutable", "peer"}});
-    EXPECT_TRUE(vantrel::testing::installTestPeer(bundle + "/peer"));
-    EXPECT_TRUE(
-        platform::writePropertyListFile(bundle + "/Entitlements.plist", Value(entitlements), 0644)
-            .has_value());
-    return bundle + "/peer";
-  }
-  // Starts peer with the "request" mode, through setpriv --no-new-privs when
-  // sandboxed; its answer line is *answer. The peer runs until destroyed.
-  std::unique_ptr<PeerProcess> ask(const std::string& peer, const char* type, uint64_t flags,
-                                   const std::vector<base::Uuid>& uuids, std::string* answer,
-                                   bool sandboxed = false) {
-    std::vector<std::string> args{"request", socket_, type, std::to_string(flags)};
-    for (const base::Uuid& uuid : uuids) args.push_back(uuid.string());
-    if (sandboxed) args.insert(args.begin(), {"--no-new-privs", peer});
-    auto process = PeerProcess::start(sandboxed ? "/usr/bin/setpriv" : peer, args);
-    EXPECT_NE(process, nullptr);
-    *answer = process ? process->readLine().value_or("(nothing)") : "(not started)";
-    return process;
-  }
-
-  std::string container(const base::Uuid& uuid) const {
-    return tmp_.file("state") + "/containers/" + uuid.string();
-  }
-  std::string launchFile(pid_t pid, const std::string& identifier) const {
-    return platform::launchDescriptionPath(serviceManagerDirectory(), pid, identifier);
-  }
-};
 
 TEST_F(Discovery, RulePatterns) {
   base::LogCapture log;
@@ -274,6 +169,69 @@ TEST_F(Discovery, DuplicatesResolvedByVersion) {
   }
 }
 
+// Equal versions are settled by registration time, in whole seconds, except
+// that a system plug-in visited after a non-system one always wins. The
+// expected winner of each pair is worked out from the visit order, which the
+// result list keeps when every registration is kept. The registry visits in
+// path order: <tmp>/Early < <tmp>/System < <tmp>/apps, so the pairs below
+// meet each step of the rule.
+TEST_F(Discovery, DuplicatesResolvedByTimeAndSystemResidence) {
+  const std::string systemS = addPlugIn("", "com.s");
+  addPlugIn("", "com.r");
+  addPlugIn("A", "com.t");
+  addPlugIn("C", "com.eq");
+  addPlugIn("D", "com.eq");
+  // The rest registers early in a later second, so that the com.q pair most
+  // likely shares its second: the system rule alone then decides it.
+  using Clock = std::chrono::system_clock;
+  const auto next = std::chrono::ceil<std::chrono::seconds>(Clock::now());
+  std::this_thread::sleep_until(next + std::chrono::milliseconds(20));
+  addPlugIn(std::string(kEarlyApps) + "/Q", "com.q");
+  addPlugIn("", "com.q");
+  addPlugIn(std::string(kEarlyApps) + "/R", "com.r");  // newer, visited before the system one
+  const std::string newerT = addPlugIn("B", "com.t");
+  addPlugIn("A", "com.s");  // newer, visited after the system one
+
+  const auto pathOf = [](const Value& form) {
+    return *form.getIfDictionary()->get("path").getIfString();
+  };
+  const auto reported = [&](const char* identifier, uint64_t flags) {
+    std::vector<std::string> paths;
+    for (const Value& form : matches({{"rules", Dictionary{{"QXExtensionIdentifier", identifier}}},
+                                      {"flags", u64(flags)}})) {
+      paths.push_back(pathOf(form));
+    }
+    return paths;
+  };
+  // What the rule keeps of two registrations visited in this order.
+  const auto winner = [&](const Value& first, const Value& second) {
+    const Dictionary &e = *first.getIfDictionary(), &p = *second.getIfDictionary();
+    const Value yes = Value::boolean(true);
+    const bool systemSecond = p.get("systemResident") == yes && e.get("systemResident") != yes;
+    return pathOf(systemSecond || p.get("lastmodified").integerValue() >
+                                      e.get("lastmodified").integerValue()
+                      ? second
+                      : first);
+  };
+  for (const char* id : {"com.s", "com.q", "com.r", "com.t", "com.eq"}) {
+    const Array both =
+        matches({{"rules", Dictionary{{"QXExtensionIdentifier", id}}}, {"flags", u64(0x1 | 0x4)}});
+    ASSERT_EQ(both.size(), 2u) << id;
+    const std::vector<std::string> expected{winner(both[0], both[1])};
+    EXPECT_EQ(reported(id, 0x0), expected) << id;
+    EXPECT_EQ(reported(id, 0x1), expected) << id;
+  }
+  EXPECT_EQ(reported("com.t", 0x0), std::vector<std::string>{newerT});
+
+  // Only the system plug-ins are left when the client asks for system ones.
+  const Array system = matches({{"flags", u64(0x8)}});
+  ASSERT_EQ(system.size(), 3u);
+  for (const Value& form : system) {
+    EXPECT_EQ(form.getIfDictionary()->get("systemResident"), Value::boolean(true));
+  }
+  EXPECT_EQ(formOf(system, "com.s").get("path"), Value(systemS));
+}
+
 TEST_F(Discovery, ReplacementMarks) {
   const std::string path = addPlugIn(
       "Replacer", "com.rep", {}, {},
@@ -351,96 +309,6 @@ TEST_F(Discovery, AuthorisationReasons) {
     EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("widget")}}})), expected)
         << maximum.value_or(-1);
   }
-}
-
-TEST_F(Discovery, ReadyEnablesOnlyWhenEveryPlugInPasses) {
-  base::LogCapture log;
-  const pid_t self = ::getpid();
-  const std::string share = launchFile(self, kShare);
-  std::error_code ignored;
-  std::filesystem::remove(share, ignored);  // left by an earlier test of this process
-  request("lock", {{"flags", u64(2)}, {"paths", Array{plugInPath("widget")}}});
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("share"), uuidOf("widget")}}})),
-            Expected(11, "access to plugin com.x.widget denied: the plug-in is on hold"));
-  EXPECT_FALSE(std::filesystem::exists(share));
-
-  // The same plug-in twice is checked twice and enabled once.
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("share"), uuidOf("share")}}})),
-            Expected(0, ""));
-  const std::string enabling = base::format("enabling pid=%d for plug-in com.x.share(", self);
-  const std::vector<std::string> lines = log.lines();
-  EXPECT_EQ(
-      std::count_if(lines.begin(), lines.end(),
-                    [&](const std::string& line) {
-                      return line.starts_with(enabling) &&
-                             line.ends_with(uuidOf("share").string() + " " + plugInPath("share"));
-                    }),
-      1);
-  EXPECT_TRUE(std::filesystem::exists(share));
-
-  // The bundle's own environment wins over the data container.
-  const Dictionary service{{"EnvironmentVariables", Dictionary{{"HOME", "/own"}}}};
-  const std::string own = addPlugIn("Own", "com.o.own", {}, {}, {}, {{"LMOService", service}});
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(own)}}})), Expected(0, ""));
-  auto file = platform::readPropertyListFile(launchFile(self, "com.o.own"));
-  ASSERT_TRUE(file.has_value()) << file.error().description();
-  auto description = platform::decodeLaunchDescription(file.value());
-  ASSERT_TRUE(description.has_value()) << description.error().description();
-  const std::vector<std::string>& environment = description.value().environment;
-  EXPECT_NE(std::find(environment.begin(), environment.end(), "HOME=/own"), environment.end());
-
-  const std::string bare = addPlugIn("Bare", "com.n.bare", {}, {}, {}, {}, false);
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(bare)}}})),
-            Expected(4, "cannot obtain executable path for plug-in com.n.bare(" +
-                            uuidAt(bare).string() + ")"));
-}
-
-TEST_F(Discovery, LaunchDescriptionLastsAsLongAsTheHost) {
-  std::string answer;
-  auto host = ask(peerWith("Host", {}), "ready", 0, {uuidOf("widget")}, &answer);
-  ASSERT_EQ(answer, "ok");
-  const std::string file = launchFile(host->pid(), kWidget);
-  auto value = platform::readPropertyListFile(file);
-  ASSERT_TRUE(value.has_value()) << value.error().description();
-  auto description = platform::decodeLaunchDescription(value.value());
-  ASSERT_TRUE(description.has_value()) << description.error().description();
-  const std::string home = container(uuidOf("widget"));
-  const std::vector<std::string>& environment = description.value().environment;
-  for (const std::string& entry : {"HOME=" + home, "TMPDIR=" + home + "/tmp"}) {
-    EXPECT_NE(std::find(environment.begin(), environment.end(), entry), environment.end()) << entry;
-  }
-  EXPECT_EQ(description.value().sandboxProfile, "plugin");
-
-  host->closeStdin();
-  host->wait();
-  EXPECT_TRUE(eventually([&] { return !std::filesystem::exists(file); }));
-}
-
-TEST_F(Discovery, AccessGivesATokenPerPlugIn) {
-  const Dictionary empty = request("access", {{"uuids", Array{}}});
-  EXPECT_EQ(empty.get("extensions"), Value(Array{})) << lmo::describe(empty);
-
-  const Value widget = uuidOf("widget"), share = uuidOf("share");
-  const Dictionary reply = request("access", {{"uuids", Array{share, widget}}});
-  const Array* tokens = reply.get("extensions").getIfArray();
-  ASSERT_TRUE(tokens != nullptr && tokens->size() == 2) << lmo::describe(reply);
-  // In request order: the first opens the share bundle, whose Info.plist
-  // can be read through it.
-  const int64_t handle = platform::sandbox_extension_consume(*(*tokens)[0].getIfString());
-  ASSERT_GT(handle, 0);
-  const int info = ::openat(platform::sandbox_extension_descriptor(handle), "Info.plist", O_RDONLY);
-  ASSERT_GE(info, 0);
-  std::string text(4096, '\0');
-  text.resize(static_cast<size_t>(std::max<ssize_t>(0, ::read(info, text.data(), text.size()))));
-  ::close(info);
-  EXPECT_NE(text.find(kShare), std::string::npos) << text;
-  EXPECT_EQ(platform::sandbox_extension_release(handle), 0);
-
-  std::filesystem::remove_all(plugInPath("share"));
-  const Dictionary failed = request("access", {{"uuids", Array{widget, share}}});
-  EXPECT_EQ(errorOf(failed),
-            Expected(4, "cannot create extension to " + plugInPath("share") + ": 2"));
-  EXPECT_FALSE(failed.contains("extensions"));
 }
 
 }  // namespace

@@ -25,15 +25,25 @@
 //              "error <code> <message>"; then blocks until standard input
 //              closes (what the request set up for this process, such as an
 //              enabled plug-in, lasts as long as it runs); exit 0.
-// In the last three modes a connection that fails or a daemon that does not
-// answer within 30 s gives "error <code> <message>\n" and exit 1. Log lines go
-// to standard error. Anything else: a usage line on standard error, exit 2.
+//   read-token <token> <name>
+//              consumes the file-access token as a host does, opens name
+//              relative to the directory it opens and writes the file's
+//              first kMaxTokenReadBytes bytes to standard output, with a
+//              final "\n" added when they lack one; exit 0. A token that is
+//              refused or a name that cannot be opened or read gives
+//              "error <errno>\n" and exit 1.
+// In the connect, hold and request modes a connection that fails or a daemon
+// that does not answer within 30 s gives "error <code> <message>\n" and
+// exit 1. Log lines go to standard error. Anything else: a usage line on
+// standard error, exit 2.
 //
 // The project's libraries are linked statically, so copying the one file is
 // still enough.
 
+#include <fcntl.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -45,6 +55,7 @@
 
 #include "base/Log.h"
 #include "client/VTDaemonClient.h"
+#include "platform/SandboxExtensionService.h"
 
 namespace {
 
@@ -52,7 +63,11 @@ using vantrel::client::VTDaemonClient;
 
 constexpr int kConnectionFailedExit = 1;
 constexpr int kUsageExit = 2;
+constexpr int kReadFailedExit = 1;
 constexpr std::chrono::milliseconds kReplyTimeout = std::chrono::seconds(30);
+// The most of a file read through a token that is written out: a bundle's
+// Info.plist is far smaller.
+constexpr size_t kMaxTokenReadBytes = 64 * 1024;
 
 int blockUntilStdinCloses() {
   char buffer[256];
@@ -156,6 +171,32 @@ int requestAndWait(const char* service, const char* type, uint64_t flags,
   return blockUntilStdinCloses();
 }
 
+int readThroughToken(const std::string& token, const char* name) {
+  namespace platform = vantrel::platform;
+  const auto fail = [] {
+    printLine(vantrel::base::format("error %d", errno));
+    return kReadFailedExit;
+  };
+  const int64_t handle = platform::sandbox_extension_consume(token);
+  if (handle < 0) return fail();
+  const int fd =
+      ::openat(platform::sandbox_extension_descriptor(handle), name, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return fail();
+  std::string text;
+  char buffer[4096];
+  for (ssize_t n = 1; n != 0 && text.size() < kMaxTokenReadBytes;) {
+    n = ::read(fd, buffer, std::min(sizeof buffer, kMaxTokenReadBytes - text.size()));
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return fail();
+    text.append(buffer, static_cast<size_t>(n));
+  }
+  ::close(fd);
+  platform::sandbox_extension_release(handle);
+  if (text.empty() || text.back() != '\n') text += '\n';
+  std::fwrite(text.data(), 1, text.size(), stdout);
+  return std::fflush(stdout) == 0 ? 0 : kReadFailedExit;
+}
+
 std::optional<std::vector<vantrel::base::Uuid>> parseUuids(char** first, char** last) {
   std::vector<vantrel::base::Uuid> uuids;
   for (char** arg = first; arg != last; ++arg) {
@@ -185,6 +226,7 @@ int main(int argc, char** argv) {
   if (argc == 2 && mode == "sleep") return sleepUntilStdinCloses();
   if (argc == 2 && mode == "print-pid") return printPid();
   if (argc == 3 && mode == "connect") return connectAndWait(argv[2]);
+  if (argc == 4 && mode == "read-token") return readThroughToken(argv[2], argv[3]);
   if (argc >= 4 && mode == "hold") {
     if (auto flags = parseFlags(argv[3])) {
       return holdAndWait(argv[2], *flags, std::vector<std::string>(argv + 4, argv + argc));
@@ -197,7 +239,7 @@ int main(int argc, char** argv) {
   }
   std::fprintf(stderr,
                "usage: %s sleep|print-pid|connect <service>|hold <service> <flags> [<path>...]"
-               "|request <service> <type> <flags> [<uuid>...]\n",
+               "|request <service> <type> <flags> [<uuid>...]|read-token <token> <name>\n",
                argc > 0 ? argv[0] : "vantrel-test-peer");
   return kUsageExit;
 }
