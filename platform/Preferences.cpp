@@ -92,27 +92,22 @@ lmo::Value Preferences::valueForKey(std::string_view key) {
 base::Result<void> Preferences::synchronizeLocked(bool force) {
   // O_NONBLOCK keeps a FIFO planted at the path from stalling the caller.
   ScopedFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  FileStamp stamp;
+  // The errno of a failed open or fstat is part of the stamp (ENOENT: no file).
   struct stat st = {};
-  if (fd.get() < 0) {
-    stamp.openError = errno;
-  } else if (::fstat(fd.get(), &st) != 0) {
-    stamp.openError = errno;
-  } else {
-    stamp = FileStamp{0, st.st_dev, st.st_ino, st.st_size,
-                      int64_t{st.st_mtim.tv_sec} * 1'000'000'000 + st.st_mtim.tv_nsec};
-  }
+  const FileStamp stamp = fd.get() < 0                  ? FileStamp::failed(errno)
+                          : ::fstat(fd.get(), &st) != 0 ? FileStamp::failed(errno)
+                                                        : FileStamp::of(st);
   if (loaded_ && !force && stamp == stamp_) return base::Result<void>::success();
 
   const bool changed = !loaded_ || stamp != stamp_;
   loaded_ = true;
   stamp_ = stamp;
   values_ = lmo::Dictionary();
-  if (stamp.openError == ENOENT) return base::Result<void>::success();
+  if (stamp.error == ENOENT) return base::Result<void>::success();
 
   base::Result<lmo::Dictionary> contents =
-      stamp.openError != 0
-          ? base::Result<lmo::Dictionary>(posixError(stamp.openError, "cannot open", path_))
+      stamp.error != 0
+          ? base::Result<lmo::Dictionary>(posixError(stamp.error, "cannot open", path_))
           : readDomain(fd.get(), st, path_);
   if (!contents.has_value()) {
     // Logged once per version of the file, not at every synchronize.

@@ -15,6 +15,7 @@
 
 #include "base/Result.h"
 #include "lmo/Value.h"
+#include "platform/FileStamp.h"
 
 namespace vantrel::platform {
 
@@ -40,8 +41,8 @@ class Preferences {
   const std::string& domain() const { return domain_; }
   const std::string& path() const { return path_; }
 
-  // Re-reads the file when it differs from the one last read (inode, size or
-  // modification time in nanoseconds). A missing file is an empty domain. A
+  // Re-reads the file when it differs from the one last read (a FileStamp:
+  // inode, size, owner, mode, modification and change times). A missing file is an empty domain. A
   // file that cannot be read or is not a property-list dictionary (malformed,
   // above the property-list size limit, not a regular file) is an empty
   // domain too, with one log line per change of the file; it is never
@@ -62,17 +63,6 @@ class Preferences {
   base::Result<void> setValue(std::string_view key, const lmo::Value& value);
 
  private:
-  // What identifies one version of the file. openError is 0 when the file
-  // was opened, else the errno of the failed open (ENOENT: no file).
-  struct FileStamp {
-    int openError = 0;
-    dev_t device = 0;
-    ino_t inode = 0;
-    off_t size = 0;
-    int64_t modifiedNs = 0;
-    bool operator==(const FileStamp&) const = default;
-  };
-
   // Re-reads when forced or when the file changed; returns the error that
   // made the domain empty, if any. Requires mutex_.
   base::Result<void> synchronizeLocked(bool force);

@@ -15,6 +15,7 @@
 #include <string_view>
 
 #include "platform/Digest.h"
+#include "platform/FileStamp.h"
 #include "platform/Paths.h"
 
 namespace vantrel::platform {
@@ -109,45 +110,18 @@ std::string secretPath() {
   return stateDirectory() + "/" + kSandboxSecretFileName;
 }
 
-// A secret file's identity and every attribute that a change of its content,
-// owner or mode touches (ctime moves with each of them).
-struct SecretStamp {
-  dev_t device = 0;
-  ino_t inode = 0;
-  mode_t mode = 0;
-  uid_t owner = 0;
-  off_t size = 0;
-  timespec modified{}, changed{};
-
-  explicit SecretStamp(const struct stat& st)
-      : device(st.st_dev),
-        inode(st.st_ino),
-        mode(st.st_mode),
-        owner(st.st_uid),
-        size(st.st_size),
-        modified(st.st_mtim),
-        changed(st.st_ctim) {}
-  SecretStamp() = default;
-  bool operator==(const SecretStamp& o) const {
-    return device == o.device && inode == o.inode && mode == o.mode && owner == o.owner &&
-           size == o.size && modified.tv_sec == o.modified.tv_sec &&
-           modified.tv_nsec == o.modified.tv_nsec && changed.tv_sec == o.changed.tv_sec &&
-           changed.tv_nsec == o.changed.tv_nsec;
-  }
-};
-
 // The last secret read, kept while its file is unchanged: one stat instead
 // of an open and a read per token. Deleting, replacing or loosening the file
 // still takes effect at the next issue or consume.
 class SecretCache {
  public:
-  bool find(const std::string& path, const SecretStamp& stamp, std::string* secret) {
+  bool find(const std::string& path, const FileStamp& stamp, std::string* secret) {
     std::lock_guard lock(mutex_);
-    if (path != path_ || !(stamp == stamp_)) return false;
+    if (path != path_ || stamp != stamp_) return false;
     *secret = secret_;
     return true;
   }
-  void remember(const std::string& path, const SecretStamp& stamp, const std::string& secret) {
+  void remember(const std::string& path, const FileStamp& stamp, const std::string& secret) {
     std::lock_guard lock(mutex_);
     path_ = path;
     stamp_ = stamp;
@@ -157,7 +131,7 @@ class SecretCache {
  private:
   std::mutex mutex_;
   std::string path_;    // guarded by mutex_
-  SecretStamp stamp_;   // guarded by mutex_
+  FileStamp stamp_;     // guarded by mutex_
   std::string secret_;  // guarded by mutex_
 };
 
@@ -177,7 +151,7 @@ int readSecret(const std::string& path, std::string* secret) {
   struct stat st;
   if (::fstatat(AT_FDCWD, path.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
   if (int err = checkSecretFile(st)) return err;
-  if (secretCache().find(path, SecretStamp(st), secret)) return 0;
+  if (secretCache().find(path, FileStamp::of(st), secret)) return 0;
   const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
   if (fd < 0) return errno;
   int err = 0;
@@ -192,7 +166,7 @@ int readSecret(const std::string& path, std::string* secret) {
       err = EINVAL;  // damaged: better to refuse than to run with a short key
     } else {
       secret->assign(buffer, kSandboxSecretBytes);
-      secretCache().remember(path, SecretStamp(st), *secret);
+      secretCache().remember(path, FileStamp::of(st), *secret);
     }
   }
   ::close(fd);

@@ -14,6 +14,7 @@
 #include "base/Result.h"
 #include "lmo/Value.h"
 #include "platform/AtomicFile.h"
+#include "platform/FileStamp.h"
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 
@@ -188,24 +189,13 @@ std::optional<std::string> asIdentifier(std::string_view s) {
   return std::string(s);
 }
 
-struct FileStamp {
-  int statError = 0;
-  dev_t device = 0;
-  ino_t inode = 0;
-  off_t size = 0;
-  int64_t modifiedNs = 0;
-  bool operator==(const FileStamp&) const = default;
-};
-
 std::string declarationsPath(const std::string& directory) {
   return directory + "/" + kTypeDeclarationsFileName;
 }
 
 FileStamp stampOf(const std::string& path) {
   struct stat st = {};
-  if (::stat(path.c_str(), &st) != 0) return FileStamp{errno};
-  return FileStamp{0, st.st_dev, st.st_ino, st.st_size,
-                   int64_t{st.st_mtim.tv_sec} * 1'000'000'000 + st.st_mtim.tv_nsec};
+  return ::stat(path.c_str(), &st) != 0 ? FileStamp::failed(errno) : FileStamp::of(st);
 }
 
 // What TypeRegistry::shared() last loaded.
@@ -253,7 +243,7 @@ struct TypeRegistry::Loader {
   void readFile(const std::string& path) {
     const FileStamp stamp = stampOf(path);
     // No file is the common case: most SDK directories declare no types.
-    if (stamp.statError == ENOENT || stamp.statError == ENOTDIR) return;
+    if (stamp.error == ENOENT || stamp.error == ENOTDIR) return;
     base::Result<lmo::Value> contents = readPropertyListFile(path);
     if (!contents.has_value()) return ignoreFile(path, contents.error().description());
     const lmo::Array* entries = contents->getIfArray();

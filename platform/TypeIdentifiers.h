@@ -52,8 +52,8 @@ class TypeRegistry {
 
   // The process-wide registry over platform::sdkDirectories(). Each call
   // checks the directory list and every types.plist in it (one stat(2) per
-  // directory) and loads the registry afresh when any changed (path, inode,
-  // size or modification time). The returned registry never changes; hold it
+  // directory) and loads the registry afresh when any changed (path, or its
+  // FileStamp). The returned registry never changes; hold it
   // across many queries to pay for the check once. Thread-safe.
   static SharedPtr shared();
 

@@ -16,6 +16,7 @@
 #include "client/VTPlugInLauncher.h"
 #include "omnidex/PrivacyConsent.h"
 #include "tests/daemon/DiscoveryFixture.h"
+#include "tests/support/ScopedEnvironment.h"
 
 namespace vantrel::daemon::testing {
 namespace {
@@ -27,21 +28,7 @@ using lmo::Value;
 
 using Enabling = Discovery;
 
-// Sets an environment variable for the object's life, then restores it.
-class ScopedVariable {
- public:
-  ScopedVariable(const char* name, const std::string& value) : name_(name) {
-    if (const char* old = std::getenv(name)) previous_ = old;
-    ::setenv(name, value.c_str(), 1);
-  }
-  ~ScopedVariable() { previous_ ? ::setenv(name_, previous_->c_str(), 1) : ::unsetenv(name_); }
-  ScopedVariable(const ScopedVariable&) = delete;
-  ScopedVariable& operator=(const ScopedVariable&) = delete;
-
- private:
-  const char* name_;
-  std::optional<std::string> previous_;
-};
+using vantrel::testing::ScopedEnvironment;
 
 // Starts the plug-in as its host would and returns the lines it wrote
 // before it exited, or the launcher's error.
@@ -195,13 +182,13 @@ TEST_F(Enabling, ReadyLetsTheHostLaunchThePlugInAsDescribed) {
   const std::string reporter = addPlugIn("Env", kReporter, {}, {}, {}, executable, false);
   addPlugIn("Env", kIdle, {}, {}, {}, executable, false);
   {
-    const ScopedVariable sdk("VTTEST_SDK", "sdk-under-test");
+    const ScopedEnvironment sdk("VTTEST_SDK", "sdk-under-test");
     ASSERT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(reporter)}}})), Expected(0, ""));
   }
 
   // This process is the host: its launcher looks where the daemon's service
   // manager publishes.
-  const ScopedVariable runtime("VANTREL_RUNTIME_DIR", serviceManagerDirectory());
+  const ScopedEnvironment runtime("VANTREL_RUNTIME_DIR", serviceManagerDirectory());
   const base::Result<std::vector<std::string>> lines = launchAndRead(kReporter);
   ASSERT_TRUE(lines.has_value()) << lines.error().description();
   std::vector<std::string> environment;

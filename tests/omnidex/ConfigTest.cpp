@@ -5,6 +5,7 @@
 #include "omnidex/RecordFactory.h"
 #include "platform/Paths.h"
 #include "tests/omnidex/OmnidexFixtures.h"
+#include "tests/support/ScopedEnvironment.h"
 
 namespace vantrel::omnidex {
 namespace {
@@ -12,19 +13,7 @@ namespace {
 using testing::plugInInfo;
 using testing::writeBundle;
 
-// Sets or (value null) unsets a variable for the life of the object.
-class ScopedEnvironment {
- public:
-  ScopedEnvironment(const char* name, const char* value) : name_(name) {
-    if (const char* old = ::getenv(name)) old_ = old;
-    value ? ::setenv(name, value, 1) : ::unsetenv(name);
-  }
-  ~ScopedEnvironment() { old_ ? ::setenv(name_, old_->c_str(), 1) : ::unsetenv(name_); }
-
- private:
-  const char* name_;
-  std::optional<std::string> old_;
-};
+using vantrel::testing::ScopedEnvironment;
 
 TEST(OmnidexConfig, DirectoryListsComeFromTheEnvironment) {
   const std::vector<std::string> defaultApps{"/Applications", "/System/Applications"};

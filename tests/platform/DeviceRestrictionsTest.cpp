@@ -14,7 +14,7 @@ using lmo::Value;
 
 TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
   testing::TempDir dir, other;
-  ScopedEnv preferences("VANTREL_PREFERENCES_DIR", dir.path().string());
+  ScopedEnvironment preferences("VANTREL_PREFERENCES_DIR", dir.path().string());
   EXPECT_EQ(maximumApplicationRating(), std::nullopt) << "no file";
   // Another writer with a domain object of its own, as another process has.
   Preferences writer(kRestrictionsDomain);
@@ -39,7 +39,7 @@ TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
 
   // The process's own writer, and a switch to another store location.
   {
-    ScopedEnv elsewhere("VANTREL_PREFERENCES_DIR", other.path().string());
+    ScopedEnvironment elsewhere("VANTREL_PREFERENCES_DIR", other.path().string());
     EXPECT_EQ(maximumApplicationRating(), std::nullopt);
     ASSERT_TRUE(setMaximumApplicationRating(9).has_value());
     EXPECT_EQ(maximumApplicationRating(), 9);

@@ -19,7 +19,7 @@ namespace {
 class NotificationCenterTest : public ::testing::Test {
  protected:
   testing::TempDir dir_;
-  ScopedEnv runtimeDirectory_{"VANTREL_RUNTIME_DIR", dir_.path().string()};
+  ScopedEnvironment runtimeDirectory_{"VANTREL_RUNTIME_DIR", dir_.path().string()};
 };
 
 TEST_F(NotificationCenterTest, PostsCountPerNameAndAreSeenByInotify) {

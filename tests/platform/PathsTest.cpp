@@ -12,7 +12,7 @@ namespace vantrel::platform {
 namespace {
 
 TEST(Paths, DirectoriesFollowTheEnvironment) {
-  ScopedEnv state("VANTREL_STATE_DIR", std::nullopt), xdg("XDG_STATE_HOME", "/xdg"),
+  ScopedEnvironment state("VANTREL_STATE_DIR", std::nullopt), xdg("XDG_STATE_HOME", "/xdg"),
       home("HOME", "/home/u"), runtime("VANTREL_RUNTIME_DIR", std::nullopt),
       xdgRuntime("XDG_RUNTIME_DIR", std::nullopt);
   const bool root = ::geteuid() == 0;
@@ -20,17 +20,18 @@ TEST(Paths, DirectoriesFollowTheEnvironment) {
   EXPECT_EQ(runtimeDirectory(),
             root ? "/run/vantrel" : "/tmp/vantrel-" + std::to_string(::geteuid()));
   {
-    ScopedEnv noXdg("XDG_STATE_HOME", std::nullopt), xdgRun("XDG_RUNTIME_DIR", "/run/user/5");
+    ScopedEnvironment noXdg("XDG_STATE_HOME", std::nullopt),
+        xdgRun("XDG_RUNTIME_DIR", "/run/user/5");
     EXPECT_EQ(stateDirectory(), root ? "/var/lib/vantrel" : "/home/u/.local/state/vantrel");
     EXPECT_EQ(runtimeDirectory(), root ? "/run/vantrel" : "/run/user/5/vantrel");
   }
-  ScopedEnv override("VANTREL_STATE_DIR", "/s"), runOverride("VANTREL_RUNTIME_DIR", "/r");
+  ScopedEnvironment override("VANTREL_STATE_DIR", "/s"), runOverride("VANTREL_RUNTIME_DIR", "/r");
   EXPECT_EQ(stateDirectory(), "/s");
   EXPECT_EQ(runtimeDirectory(), "/r");
 
-  ScopedEnv sdks("VANTREL_SDK_DIRS", ":/a::/b:");
+  ScopedEnvironment sdks("VANTREL_SDK_DIRS", ":/a::/b:");
   EXPECT_EQ(sdkDirectories(), (std::vector<std::string>{"/a", "/b"}));
-  ScopedEnv noSdks("VANTREL_SDK_DIRS", std::nullopt);
+  ScopedEnvironment noSdks("VANTREL_SDK_DIRS", std::nullopt);
   EXPECT_EQ(sdkDirectories(), std::vector<std::string>{"/usr/share/vantrel/sdks"});
 }
 

@@ -33,7 +33,7 @@ class SandboxExtension : public ::testing::Test {
   vantrel::testing::TempDir dir_;
   // Each test gets its own state directory, and so its own secret.
   const std::string stateDir_ = dir_.file("state");
-  ScopedEnv stateDirectory_{"VANTREL_STATE_DIR", stateDir_};
+  ScopedEnvironment stateDirectory_{"VANTREL_STATE_DIR", stateDir_};
 };
 
 TEST_F(SandboxExtension, IssuedTokenOpensThePathReadOnly) {
@@ -66,7 +66,7 @@ TEST_F(SandboxExtension, RefusesMalformedAndForgedTokens) {
   const std::string token = sandbox_extension_issue_file(file).value();
   std::string foreign;  // made with another installation's secret
   {
-    ScopedEnv otherInstallation("VANTREL_STATE_DIR", dir_.file("other-state"));
+    ScopedEnvironment otherInstallation("VANTREL_STATE_DIR", dir_.file("other-state"));
     foreign = sandbox_extension_issue_file(file).value();
   }
   // "1;<32 hex>;<64 hex>;<path>"

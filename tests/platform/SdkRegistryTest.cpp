@@ -25,7 +25,7 @@ std::string origin(const std::string& name) {
 
 TEST(SdkRegistry, FirstDirectoryHoldingADictionaryWins) {
   testing::TempDir tmp;
-  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
+  ScopedEnvironment dirs("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
   tmp.write("first/both.plist", sdkPlist("first"));
   tmp.write("second/both.plist", sdkPlist("second"));
   tmp.write("second/later.plist", sdkPlist("second"));
@@ -47,7 +47,7 @@ TEST(SdkRegistry, FirstDirectoryHoldingADictionaryWins) {
 
 TEST(SdkRegistry, NamesThatCouldLeaveTheDirectoryAreNeverLookedUp) {
   testing::TempDir tmp;
-  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("sdks/inner"));
+  ScopedEnvironment dirs("VANTREL_SDK_DIRS", tmp.file("sdks/inner"));
   // Every file here would be found if its name were looked up as given.
   tmp.write("sdks/inner/.plist", sdkPlist("empty"));
   tmp.write("sdks/inner/..plist", sdkPlist("dot"));

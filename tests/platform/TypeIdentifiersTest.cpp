@@ -210,7 +210,7 @@ TEST(TypeIdentifiers, SharedRegistryReloadsWhenAFileOrTheDirectoriesChange) {
   testing::TempDir tmp;
   tmp.write("first/types.plist", typesFile(decl("com.example.one", {"public.image"})));
   tmp.write("second/types.plist", typesFile(decl("com.example.other", {"public.text"})));
-  ScopedEnv dirs("VANTREL_SDK_DIRS", tmp.file("first"));
+  ScopedEnvironment dirs("VANTREL_SDK_DIRS", tmp.file("first"));
   TypeRegistry::SharedPtr before = TypeRegistry::shared();
   EXPECT_TRUE(typeConformsTo("com.example.one", "public.data"));
   EXPECT_EQ(TypeRegistry::shared(), before);  // nothing changed: no reload
@@ -224,7 +224,7 @@ TEST(TypeIdentifiers, SharedRegistryReloadsWhenAFileOrTheDirectoriesChange) {
 
   std::filesystem::remove(tmp.file("first/types.plist"));
   EXPECT_FALSE(typeConformsTo("com.example.two", "public.audio"));
-  ScopedEnv both("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
+  ScopedEnvironment both("VANTREL_SDK_DIRS", tmp.file("first") + ":" + tmp.file("second"));
   EXPECT_TRUE(typeConformsTo("com.example.other", "public.text"));
 }
 
