@@ -118,15 +118,25 @@ TEST_F(Discovery, HoldsAndExclusionsHide) {
   request("lock", {{"uuids", Array{*held.get("uuids").getIfUuid()}}});
   EXPECT_EQ(matching({}), both);
 
-  // Written as another process writes it; entries that are not rule
-  // dictionaries are ignored.
-  platform::Preferences prefs(registry::kUserPrefsDomain);
-  ASSERT_TRUE(prefs
-                  .setValue(registry::kExclusionsKey,
-                            Array{"junk", Dictionary{{"QXExtensionIdentifier", kShare}}})
-                  .has_value());
+  // Another process replaces the preferences file; entries that are not
+  // rule dictionaries are ignored.
+  const auto exclusionsFromAnotherProcess = [](const std::string& value) {
+    const std::string path = platform::Preferences(registry::kUserPrefsDomain).path();
+    auto writer = vantrel::testing::PeerProcess::start(
+        "/bin/sh",
+        {"-c", R"(mkdir -p "${2%/*}" && printf %s "$1" > "$2.new" && mv "$2.new" "$2")", "sh",
+         "<?xml version=\"1.0\" encoding=\"UTF-8\"?><plist version=\"1.0\"><dict>"
+         "<key>exclusions</key>" +
+             value + "</dict></plist>",
+         path});
+    ASSERT_NE(writer, nullptr);
+    EXPECT_EQ(writer->wait(), 0);
+  };
+  exclusionsFromAnotherProcess(
+      "<array><string>junk</string><dict><key>QXExtensionIdentifier</key><string>" +
+      std::string(kShare) + "</string></dict></array>");
   EXPECT_EQ(matching({}), widget);
-  ASSERT_TRUE(prefs.setValue(registry::kExclusionsKey, Value("not a list")).has_value());
+  exclusionsFromAnotherProcess("<string>not a list</string>");
   EXPECT_EQ(matching({}), both);
 }
 
