@@ -9,6 +9,7 @@
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
 #include "model/FileUrl.h"
+#include "platform/ProcessAssertions.h"
 
 namespace vantrel::daemon {
 
@@ -69,9 +70,11 @@ void Transaction::lockDownPlugIns() {
 
   std::vector<lmo::Value> conflicts;
   std::vector<registry::VTDPlugInPtr> busy;
-  if (flags != kHoldPlugIn) {
+  if (flags != kHoldPlugIn && !plugIns.empty()) {
+    const platform::ProcessSnapshot processes = platform::ProcessSnapshot::take();
     for (const registry::VTDPlugInPtr& plugIn : plugIns) {
-      if (std::optional<lmo::Dictionary> conflict = plugIn->checkBusy(*server()->workspace())) {
+      if (std::optional<lmo::Dictionary> conflict =
+              plugIn->checkBusy(*server()->workspace(), processes)) {
         busy.push_back(plugIn);
         conflicts.emplace_back(std::move(*conflict));
       }

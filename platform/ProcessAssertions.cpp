@@ -58,12 +58,13 @@ std::optional<pid_t> pidOfEntry(const char* name) {
   return static_cast<pid_t>(pid);
 }
 
-// The bundle directory of prefixes that pid's executable lies in, or
+// The bundle directory of prefixes that the process's executable lies in, or
 // nullptr.
 const std::string* bundleOfProcess(
-    pid_t pid, const std::vector<std::pair<std::string, std::string>>& prefixes) {
-  std::optional<std::string> exe = processExecutablePath(pid);
-  if (!exe) return nullptr;
+    const ProcessSnapshot::Process& process,
+    const std::vector<std::pair<std::string, std::string>>& prefixes) {
+  const pid_t pid = process.pid;
+  const std::string* exe = &process.executable;
   for (const auto& [prefix, dir] : prefixes) {
     if (exe->size() <= prefix.size() || exe->compare(0, prefix.size(), prefix) != 0) continue;
     // Paths another mount namespace shows may name different files here.
@@ -78,13 +79,10 @@ const std::string* bundleOfProcess(
 
 }  // namespace
 
-std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
-                                              const std::vector<std::string>& bundlePaths) {
-  std::vector<lmo::Dictionary> instances;
-  const auto prefixes = directoryPrefixes(bundlePaths);
-  if (prefixes.empty()) return instances;
+ProcessSnapshot ProcessSnapshot::take() {
+  ProcessSnapshot snapshot;
   std::unique_ptr<DIR, DirectoryCloser> proc(::opendir("/proc"));
-  if (!proc) return instances;
+  if (!proc) return snapshot;
   std::vector<pid_t> pids;
   size_t scanned = 0;
   while (const dirent* entry = ::readdir(proc.get())) {
@@ -93,11 +91,30 @@ std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
   }
   std::sort(pids.begin(), pids.end());
   for (pid_t pid : pids) {
-    const std::string* dir = bundleOfProcess(pid, prefixes);
+    if (std::optional<std::string> exe = processExecutablePath(pid)) {
+      snapshot.processes_.push_back(Process{pid, std::move(*exe)});
+    }
+  }
+  return snapshot;
+}
+
+std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
+                                              const std::vector<std::string>& bundlePaths) {
+  if (bundlePaths.empty()) return {};
+  return runningInstances(bundleIdentifier, bundlePaths, ProcessSnapshot::take());
+}
+
+std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
+                                              const std::vector<std::string>& bundlePaths,
+                                              const ProcessSnapshot& snapshot) {
+  std::vector<lmo::Dictionary> instances;
+  const auto prefixes = directoryPrefixes(bundlePaths);
+  for (const ProcessSnapshot::Process& process : snapshot.processes()) {
+    const std::string* dir = bundleOfProcess(process, prefixes);
     if (dir == nullptr) continue;
     instances.push_back(lmo::Dictionary{
         {kInstanceBundleIdentifierKey, lmo::Value(std::string(bundleIdentifier))},
-        {kInstancePidKey, lmo::Value::integer(pid)},
+        {kInstancePidKey, lmo::Value::integer(process.pid)},
         {kInstanceBundlePathKey, lmo::Value(*dir)},
     });
   }

@@ -6,6 +6,8 @@
 // carry a bundle identifier (the registry does); this service only looks at
 // the processes.
 
+#include <sys/types.h>
+
 #include <cstddef>
 #include <string>
 #include <string_view>
@@ -32,8 +34,27 @@ inline constexpr const char* kExtensionBundleIdentifierKey = "ExtensionBundleIde
 // missing a process.
 inline constexpr size_t kMaxScannedProcesses = 4 * 1024 * 1024;
 
+// The executables of the running processes, read once, so that a check of
+// many plug-ins (a hold over an application) reads each process once rather
+// than once per plug-in. Processes that cannot be inspected (gone mid-scan,
+// kernel threads, zombies, not ours to inspect) are left out; no /proc gives
+// an empty snapshot.
+class ProcessSnapshot {
+ public:
+  struct Process {
+    pid_t pid;
+    std::string executable;  // as /proc/<pid>/exe names it
+  };
+  static ProcessSnapshot take();
+  const std::vector<Process>& processes() const { return processes_; }  // in pid order
+
+ private:
+  std::vector<Process> processes_;
+};
+
 // The running instances of the plug-in with bundleIdentifier whose bundles
-// are at bundlePaths, one property dictionary per process, in pid order.
+// are at bundlePaths, among the processes of snapshot (a fresh one when not
+// given), one property dictionary per process, in pid order.
 // A process counts when the path of its executable lies strictly inside one
 // of the directories (after resolving symbolic links in bundlePaths),
 // including an executable deleted or replaced since it was started. A
@@ -43,5 +64,8 @@ inline constexpr size_t kMaxScannedProcesses = 4 * 1024 * 1024;
 // instance, or no /proc, gives an empty list.
 std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
                                               const std::vector<std::string>& bundlePaths);
+std::vector<lmo::Dictionary> runningInstances(std::string_view bundleIdentifier,
+                                              const std::vector<std::string>& bundlePaths,
+                                              const ProcessSnapshot& snapshot);
 
 }  // namespace vantrel::platform

@@ -32,11 +32,17 @@ std::vector<std::string> bundlesWithIdentifier(omnidex::Workspace& registry,
 }  // namespace
 
 std::optional<lmo::Dictionary> VTDPlugIn::checkBusy(omnidex::Workspace& registry) const {
+  if (!infoKey(kBundleIdentifierKey).getIfString()) return std::nullopt;  // no /proc scan
+  return checkBusy(registry, platform::ProcessSnapshot::take());
+}
+
+std::optional<lmo::Dictionary> VTDPlugIn::checkBusy(
+    omnidex::Workspace& registry, const platform::ProcessSnapshot& processes) const {
   const lmo::Value identifierValue = infoKey(kBundleIdentifierKey);
   const std::string* bundleIdentifier = identifierValue.getIfString();
   if (bundleIdentifier == nullptr) return std::nullopt;
   const std::vector<lmo::Dictionary> instances = platform::runningInstances(
-      *bundleIdentifier, bundlesWithIdentifier(registry, *bundleIdentifier));
+      *bundleIdentifier, bundlesWithIdentifier(registry, *bundleIdentifier), processes);
   for (const lmo::Dictionary& instance : instances) {
     const lmo::Value& running = instance.get(platform::kInstanceBundleIdentifierKey);
     if (running.getIfString() != nullptr) {

@@ -19,6 +19,7 @@
 #include "model/VTPlugInCore.h"
 #include "omnidex/Records.h"
 #include "omnidex/Workspace.h"
+#include "platform/ProcessAssertions.h"
 #include "registry/VTDHost.h"
 
 namespace vantrel::registry {
@@ -155,8 +156,11 @@ class VTDPlugIn : public model::VTPlugInCore {
   // naming the running bundle under platform::kExtensionBundleIdentifierKey.
   // An instance of any registered bundle with this plug-in's bundle
   // identifier counts, so registry is asked for those bundles. Scans /proc:
-  // call it where a request may wait for that (the service queue).
+  // call it where a request may wait for that (the service queue). A caller
+  // that checks several plug-ins passes one snapshot of the processes.
   std::optional<lmo::Dictionary> checkBusy(omnidex::Workspace& registry) const;
+  std::optional<lmo::Dictionary> checkBusy(omnidex::Workspace& registry,
+                                           const platform::ProcessSnapshot& processes) const;
 
   // Every entry of info whose key does not begin with "DT" (case-sensitive);
   // empty for null.
