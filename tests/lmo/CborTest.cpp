@@ -34,40 +34,22 @@ Value nested(int depth) {
 TEST(CborTest, RoundTripsEveryKindOfValue) {
   base::Uuid uuid = base::Uuid::random();
   const Value values[] = {
-      Value(),
-      Value::boolean(true),
-      Value::boolean(false),
-      Value::unsignedInteger(0),
-      Value::unsignedInteger(23),
-      Value::unsignedInteger(24),
-      Value::unsignedInteger(255),
-      Value::unsignedInteger(256),
-      Value::unsignedInteger(65536),
+      Value(), Value::boolean(true), Value::boolean(false),
+      // Each width of the argument, at its edges.
+      Value::unsignedInteger(0), Value::unsignedInteger(23), Value::unsignedInteger(24),
+      Value::unsignedInteger(255), Value::unsignedInteger(256), Value::unsignedInteger(65536),
       Value::unsignedInteger(uint64_t{1} << 32),
-      Value::unsignedInteger(std::numeric_limits<uint64_t>::max()),
-      Value::integer(-1),
-      Value::integer(-24),
-      Value::integer(-25),
-      Value::integer(std::numeric_limits<int64_t>::min()),
-      Value::integer(std::numeric_limits<int64_t>::max()),
-      Value::real(1.5),
-      Value::real(-0.0),
-      Value::real(1e300),
-      Value(""),
-      Value("h\xC3\xA9llo \xF0\x9F\x98\x80"),
-      Value(std::string(300, 'x')),
-      Value::data(Bytes{}),
-      Value::data(Bytes{0, 1, 2, 0xFF}),
-      Value(Date{1363896240.5}),
-      Value(Date{-1.0}),
-      Value(uuid),
-      Value(Array{}),
+      Value::unsignedInteger(std::numeric_limits<uint64_t>::max()), Value::integer(-1),
+      Value::integer(-24), Value::integer(-25), Value::integer(std::numeric_limits<int64_t>::min()),
+      Value::integer(std::numeric_limits<int64_t>::max()), Value::real(1.5), Value::real(-0.0),
+      Value::real(1e300), Value(""), Value("h\xC3\xA9llo \xF0\x9F\x98\x80"),
+      Value(std::string(300, 'x')), Value::data(Bytes{}), Value::data(Bytes{0, 1, 2, 0xFF}),
+      Value(Date{1363896240.5}), Value(Date{-1.0}), Value(uuid), Value(Array{}),
       Value(Array{Value::integer(1), Value("two"), Value(Array{Value()})}),
       Value(Dictionary{{"request", Value("match")},
                        {"version", Value::unsignedInteger(3)},
                        {"rules", Value(Dictionary{{"a", Value(Array{Value(uuid)})}})}}),
-      nested(kMaxCborDepth),
-  };
+      nested(kMaxCborDepth)};
   for (const Value& v : values) {
     Value back = decodeOk(encodeOk(v));
     EXPECT_EQ(back, v) << describe(v);

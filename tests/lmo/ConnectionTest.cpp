@@ -62,6 +62,18 @@ QueuePtr makeQueue(const char* label) {
   return std::make_shared<base::SerialQueue>(label);
 }
 
+using RecorderPtr = std::shared_ptr<Recorder>;
+RecorderPtr recorder() {
+  return std::make_shared<Recorder>();
+}
+
+// Records the text of each event. Handlers capture recorders by shared
+// pointer: a connection may deliver its last event after the test that made
+// it has returned.
+Connection::EventHandler recordInto(RecorderPtr recorder) {
+  return [recorder](const Event& e) { recorder->add(eventText(e)); };
+}
+
 // A listener whose connections answer each request with {"echo": body},
 // answer {"flood": 1} with 16 MiB of messages first, and end the connection on
 // {"die": 1}. Handlers hold the shared state, never the server object, so a
@@ -131,26 +143,24 @@ class EchoServer {
   std::shared_ptr<Listener> listener_;
 };
 
-using RecorderPtr = std::shared_ptr<Recorder>;
-RecorderPtr recorder() {
-  return std::make_shared<Recorder>();
-}
-
-// Handlers capture recorders by shared pointer: a connection may deliver its
-// last event after the test that made it has returned.
 std::shared_ptr<Connection> connectRecorded(const std::string& path, const RecorderPtr& recorder) {
   auto c = Connection::connectToService(path, makeQueue("client"));
-  c->setEventHandler([recorder](const Event& e) { recorder->add(eventText(e)); });
+  c->setEventHandler(recordInto(recorder));
   c->resume();
   return c;
+}
+
+sockaddr_un unixAddress(const std::string& path) {
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::memcpy(addr.sun_path, path.data(), path.size());
+  return addr;
 }
 
 // A plain socket connected to path, for writing raw bytes.
 int rawConnect(const std::string& path) {
   int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::memcpy(addr.sun_path, path.data(), path.size());
+  sockaddr_un addr = unixAddress(path);
   EXPECT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
   return fd;
 }
@@ -159,52 +169,53 @@ Bytes frameOf(FrameKind kind, uint64_t id, const Dictionary& body) {
   return encodeFrame({kind, id, 0, body}).value();
 }
 
-TEST(ConnectionTest, RepliesReachTheirOwnHandlersOnce) {
-  testing::TempDir dir;
-  std::string path = dir.file("svc");
-  EchoServer server(path);
+// An echo server listening at "svc" in a fresh directory.
+class ConnectionTest : public ::testing::Test {
+ protected:
+  // Sends body on c; its reply (or failure) is recorded in replies.
+  void request(Connection& c, const Dictionary& body, const RecorderPtr& replies) {
+    ASSERT_TRUE(c.sendWithReply(body, replyQueue_, recordInto(replies)).has_value());
+  }
+
+  testing::TempDir dir_;
+  const std::string path_ = dir_.file("svc");
+  EchoServer server_{path_};
+  QueuePtr replyQueue_ = makeQueue("replies");
+};
+
+TEST_F(ConnectionTest, RepliesReachTheirOwnHandlersOnce) {
   struct stat st {};
-  ASSERT_EQ(::stat(path.c_str(), &st), 0);
+  ASSERT_EQ(::stat(path_.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0666u);
 
-  auto eventsA = recorder(), eventsB = recorder(), replies = recorder();
-  auto a = connectRecorded(path, eventsA);
-  auto b = connectRecorded(path, eventsB);
-  auto replyQueue = makeQueue("replies");
+  auto eventsA = recorder(), eventsB = recorder();
+  auto a = connectRecorded(path_, eventsA);
+  auto b = connectRecorded(path_, eventsB);
+  // Each request has a recorder of its own: its handler must see its reply
+  // and nothing else.
+  std::vector<std::pair<std::string, RecorderPtr>> sent;
   for (int i = 0; i < 3; ++i) {
-    for (auto* c : {&a, &b}) {
-      std::string tag = (c == &a ? "a" : "b") + std::to_string(i);
-      ASSERT_TRUE((*c)->sendWithReply(Dictionary{{"tag", Value(tag)}}, replyQueue,
-                                      [replies, tag](const Event& e) {
-                                        const IncomingMessage* m = e.message();
-                                        const Value& echo = m ? m->body().get("echo") : Value();
-                                        const Dictionary* d = echo.getIfDictionary();
-                                        replies->add(tag + "=" +
-                                                     (d ? describe(d->get("tag")) : "?"));
-                                      })
-                      .has_value());
+    for (const auto& [name, c] : {std::pair{"a", a}, std::pair{"b", b}}) {
+      sent.emplace_back(name + std::to_string(i), recorder());
+      request(*c, Dictionary{{"tag", Value(sent.back().first)}}, sent.back().second);
     }
   }
   ASSERT_TRUE(a->send(Dictionary{{"note", Value("no reply")}}).has_value());
-  ASSERT_TRUE(replies->waitFor(6));
-  ASSERT_TRUE(server.serverEvents.waitFor(7));
+  for (const auto& [tag, replies] : sent) ASSERT_TRUE(replies->waitFor(1)) << tag;
+  ASSERT_TRUE(server_.serverEvents.waitFor(7));
   a->cancel();
   b->cancel();
   ASSERT_TRUE(eventsA->waitFor(1));
   ASSERT_TRUE(eventsB->waitFor(1));
-  ASSERT_TRUE(server.serverEvents.waitFor(9));
-  for (int i = 0; i < 3; ++i) {
-    for (const char* c : {"a", "b"}) {
-      std::string tag = c + std::to_string(i);
-      EXPECT_EQ(replies->count(tag + "=" + tag), 1u) << tag;
-    }
+  ASSERT_TRUE(server_.serverEvents.waitFor(9));
+  for (const auto& [tag, replies] : sent) {
+    EXPECT_EQ(replies->events(), std::vector<std::string>{"{echo = {tag = " + tag + "}}"});
   }
-  EXPECT_EQ(replies->events().size(), 6u);
   EXPECT_EQ(eventsA->events(), std::vector<std::string>{"connection invalid"});
-  EXPECT_EQ(server.serverEvents.count("connection invalid"), 2u);
+  EXPECT_EQ(server_.serverEvents.count("connection invalid"), 2u);
 
   // Both ends see the other's kernel credentials; here that is this process.
-  for (const auto& c : server.accepted()) {
+  for (const auto& c : server_.accepted()) {
     EXPECT_EQ(c->pid(), ::getpid());
     EXPECT_EQ(c->uid(), ::geteuid());
     EXPECT_EQ(c->gid(), ::getegid());
@@ -216,28 +227,20 @@ TEST(ConnectionTest, RepliesReachTheirOwnHandlersOnce) {
   }
 }
 
-TEST(ConnectionTest, ConnectionEndFailsPendingRepliesAndRunsTheFinalizer) {
-  testing::TempDir dir;
-  std::string path = dir.file("svc");
-  EchoServer server(path);
+TEST_F(ConnectionTest, ConnectionEndFailsPendingRepliesAndRunsTheFinalizer) {
   auto events = recorder(), replies = recorder(), finalized = recorder();
   auto context = std::make_shared<int>(7);
   std::weak_ptr<int> weakContext = context;
-  auto c = Connection::connectToService(path, makeQueue("client"));
-  c->setEventHandler([events](const Event& e) { events->add(eventText(e)); });
+  auto c = Connection::connectToService(path_, makeQueue("client"));
+  c->setEventHandler(recordInto(events));
   c->setContext(context);
   c->setFinalizer([finalized, events] {
     finalized->add("finalized after " + std::to_string(events->events().size()) + " events");
   });
   context.reset();
   c->resume();
-  auto replyQueue = makeQueue("replies");
-  for (int i = 0; i < 3; ++i) {
-    // The server never answers these: it ends the connection on the first.
-    ASSERT_TRUE(c->sendWithReply(Dictionary{{"die", Value::integer(1)}}, replyQueue,
-                                 [replies](const Event& e) { replies->add(eventText(e)); })
-                    .has_value());
-  }
+  // The server never answers these: it ends the connection on the first.
+  for (int i = 0; i < 3; ++i) request(*c, Dictionary{{"die", Value::integer(1)}}, replies);
   ASSERT_TRUE(replies->waitFor(3));
   ASSERT_TRUE(finalized->waitFor(1));
   EXPECT_EQ(replies->count("connection invalid"), 3u);
@@ -252,32 +255,25 @@ TEST(ConnectionTest, ConnectionEndFailsPendingRepliesAndRunsTheFinalizer) {
   EXPECT_TRUE(weakContext.expired());
 
   // After the end, a request fails at once instead of waiting for ever.
-  ASSERT_TRUE(c->sendWithReply(Dictionary{}, replyQueue, [replies](const Event& e) {
-                 replies->add(eventText(e));
-               }).has_value());
+  request(*c, Dictionary{}, replies);
   ASSERT_TRUE(replies->waitFor(4));
   EXPECT_EQ(replies->count("connection invalid"), 4u);
 
   // A service nobody listens on behaves the same.
   auto missingEvents = recorder();
-  auto missing = connectRecorded(dir.file("nobody"), missingEvents);
+  auto missing = connectRecorded(dir_.file("nobody"), missingEvents);
   ASSERT_TRUE(missingEvents->waitFor(1));
   EXPECT_EQ(missingEvents->events(), std::vector<std::string>{"connection invalid"});
 }
 
-TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
-  testing::TempDir dir;
-  std::string path = dir.file("svc");
-  EchoServer server(path);
+TEST_F(ConnectionTest, BadInputClosesOnlyThatPeer) {
   auto events = recorder(), replies = recorder();
-  auto good = connectRecorded(path, events);
-  auto replyQueue = makeQueue("replies");
+  auto good = connectRecorded(path_, events);
 
+  // Every frame the reader refuses takes one path; its reasons are the
+  // frame tests' business. These are a header, a body, and the two refusals
+  // the connection makes itself.
   Bytes oversized = {0x01, 0x00, 0x00, 0x01};  // 16 MiB + 1, refused from the length alone
-  Bytes badVersion = frameOf(FrameKind::kMessage, 1, Dictionary{});
-  badVersion[4] = 9;
-  Bytes badKind = frameOf(FrameKind::kMessage, 1, Dictionary{});
-  badKind[5] = 7;
   Bytes notMap = {0, 0, 0, 21, 1, 2, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 0, 0x01};
   Bytes truncated = frameOf(FrameKind::kMessage, 1, Dictionary{{"k", Value("v")}});
   truncated.pop_back();
@@ -289,8 +285,6 @@ TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
   };
   const Case cases[] = {
       {"too long", oversized, "exceeds the limit"},
-      {"unknown version", badVersion, "unknown frame version 9"},
-      {"unknown kind", badKind, "unknown frame kind 7"},
       {"not a map", notMap, "not a map"},
       {"truncated", truncated, "truncated frame"},
       {"reply to nothing", strayReply, "reply to unknown message 99"},
@@ -299,7 +293,7 @@ TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
   size_t serverEvents = 0;  // the bad peers' invalidations and the good client's requests
   for (const Case& c : cases) {
     base::LogCapture log;
-    int fd = rawConnect(path);
+    int fd = rawConnect(path_);
     ASSERT_EQ(::send(fd, c.bytes.data(), c.bytes.size(), MSG_NOSIGNAL),
               static_cast<ssize_t>(c.bytes.size()));
     if (std::string(c.name) == "truncated") ::shutdown(fd, SHUT_WR);
@@ -308,8 +302,8 @@ TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
     EXPECT_EQ(::recv(fd, &byte, 1, 0), 0) << c.name;
     ::close(fd);
     ++invalidations;
-    ASSERT_TRUE(server.serverEvents.waitFor(++serverEvents)) << c.name;
-    EXPECT_EQ(server.serverEvents.count("connection invalid"), invalidations) << c.name;
+    ASSERT_TRUE(server_.serverEvents.waitFor(++serverEvents)) << c.name;
+    EXPECT_EQ(server_.serverEvents.count("connection invalid"), invalidations) << c.name;
     std::vector<std::string> lines = log.lines();
     ASSERT_EQ(lines.size(), 1u) << c.name;
     EXPECT_EQ(lines[0].rfind("closing connection from pid " + std::to_string(::getpid()) + ": ", 0),
@@ -318,9 +312,7 @@ TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
     EXPECT_NE(lines[0].find(c.reason), std::string::npos) << lines[0];
 
     // The well-behaved client is still served.
-    ASSERT_TRUE(good->sendWithReply(Dictionary{{"after", Value(c.name)}}, replyQueue,
-                                    [replies](const Event& e) { replies->add(eventText(e)); })
-                    .has_value());
+    request(*good, Dictionary{{"after", Value(c.name)}}, replies);
     ++serverEvents;
     ASSERT_TRUE(replies->waitFor(invalidations)) << c.name;
     EXPECT_FALSE(replies->events().back() == "connection invalid") << c.name;
@@ -328,33 +320,27 @@ TEST(ConnectionTest, BadInputClosesOnlyThatPeer) {
   EXPECT_TRUE(events->events().empty());
 }
 
-TEST(ConnectionTest, PeerThatStopsReadingIsDisconnectedPastTheBound) {
-  testing::TempDir dir;
-  std::string path = dir.file("svc");
-  EchoServer server(path);
-  server.setOutputLimit(1024 * 1024);
+TEST_F(ConnectionTest, PeerThatStopsReadingIsDisconnectedPastTheBound) {
+  server_.setOutputLimit(1024 * 1024);
   base::LogCapture log;
-  int fd = rawConnect(path);
+  int fd = rawConnect(path_);
   Bytes flood = frameOf(FrameKind::kMessage, 1, Dictionary{{"flood", Value::integer(1)}});
   ASSERT_EQ(::send(fd, flood.data(), flood.size(), MSG_NOSIGNAL),
             static_cast<ssize_t>(flood.size()));
   // Never read: 16 MiB of output cannot fit in a 1 MiB bound plus the socket buffer.
-  ASSERT_TRUE(server.serverEvents.waitFor(2));
-  EXPECT_EQ(server.serverEvents.events()[1], "connection invalid");
+  ASSERT_TRUE(server_.serverEvents.waitFor(2));
+  EXPECT_EQ(server_.serverEvents.events()[1], "connection invalid");
   EXPECT_TRUE(log.contains("peer is not reading"));
   ::close(fd);
 }
 
-TEST(ConnectionTest, ListenerReplacesStaleSocketsOnly) {
-  testing::TempDir dir;
+TEST_F(ConnectionTest, ListenerReplacesStaleSocketsOnly) {
   auto queue = makeQueue("lmo-test");
 
   // A socket file nobody listens on any more.
-  std::string stale = dir.file("stale");
+  std::string stale = dir_.file("stale");
   int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::memcpy(addr.sun_path, stale.data(), stale.size());
+  sockaddr_un addr = unixAddress(stale);
   ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
   ::close(fd);
   auto replaced = Listener::create(stale, queue);
@@ -375,41 +361,33 @@ TEST(ConnectionTest, ListenerReplacesStaleSocketsOnly) {
   ASSERT_TRUE(events->waitFor(1));
 
   // Something that is not a socket is never removed.
-  std::string file = dir.write("plain", "keep me");
+  std::string file = dir_.write("plain", "keep me");
   auto onFile = Listener::create(file, queue);
   ASSERT_FALSE(onFile.has_value());
   EXPECT_NE(onFile.error().description().find("not a socket"), std::string::npos);
 
   // A relative name lives in the runtime directory.
-  ::setenv("VANTREL_RUNTIME_DIR", dir.file("run").c_str(), 1);
+  ::setenv("VANTREL_RUNTIME_DIR", dir_.file("run").c_str(), 1);
   auto named = Listener::create("com.example.test", queue);
   ::unsetenv("VANTREL_RUNTIME_DIR");
   ASSERT_TRUE(named.has_value());
-  EXPECT_EQ(named.value()->path(), dir.file("run") + "/com.example.test");
+  EXPECT_EQ(named.value()->path(), dir_.file("run") + "/com.example.test");
   named.value()->cancel();
   replaced.value()->cancel();
   client->cancel();
   ASSERT_TRUE(replies->waitFor(1));
 }
 
-TEST(ConnectionTest, TerminationImminentReachesHandlersAndChangesNothingElse) {
-  testing::TempDir dir;
-  std::string path = dir.file("svc");
-  EchoServer server(path);
+TEST_F(ConnectionTest, TerminationImminentReachesHandlersAndChangesNothingElse) {
   auto events = recorder(), replies = recorder();
-  auto c = connectRecorded(path, events);
-  auto replyQueue = makeQueue("replies");
-  auto ping = [&] {
-    ASSERT_TRUE(c->sendWithReply(Dictionary{{"p", Value::integer(1)}}, replyQueue,
-                                 [replies](const Event& e) { replies->add(eventText(e)); })
-                    .has_value());
-  };
-  ping();
+  auto c = connectRecorded(path_, events);
+  const Dictionary ping{{"p", Value::integer(1)}};
+  request(*c, ping, replies);
   ASSERT_TRUE(replies->waitFor(1));  // the connection is accepted and live on both ends
   IoLoop::shared().announceTerminationImminent();
   ASSERT_TRUE(events->waitFor(1));
   EXPECT_EQ(events->events()[0], "termination imminent");
-  ping();
+  request(*c, ping, replies);
   ASSERT_TRUE(replies->waitFor(2));
   EXPECT_NE(replies->events()[1], "connection invalid");
   c->cancel();

@@ -9,6 +9,10 @@
 
 namespace vantrel::model::testing {
 
+inline lmo::Value I(int64_t i) {
+  return lmo::Value::integer(i);
+}
+
 // A bundle info dictionary whose "QXExtension" is extension, plus extras.
 inline lmo::Dictionary bundleInfo(lmo::Dictionary extension, lmo::Dictionary extras = {}) {
   return extras.setting("QXExtension", lmo::Value(std::move(extension)));

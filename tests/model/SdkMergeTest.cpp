@@ -14,11 +14,8 @@ using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
 using testing::bundleInfo;
+using testing::I;
 using testing::recordAt;
-
-Value I(int64_t i) {
-  return Value::integer(i);
-}
 
 TEST(SdkMerge, MergeRules) {
   // One key per rule; nested "D" repeats the special keys one level down.

@@ -8,6 +8,7 @@
 #include "model/VTSandboxExtension.h"
 #include "model/VersionComparison.h"
 #include "platform/SandboxExtensionService.h"
+#include "tests/model/PlugInFixtures.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::model {
@@ -16,10 +17,7 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
-
-Value I(int64_t i) {
-  return Value::integer(i);
-}
+using testing::I;
 
 TEST(VersionComparison, DigitRunsNumericallyOtherBytesLiterally) {
   struct Case {
@@ -28,19 +26,14 @@ TEST(VersionComparison, DigitRunsNumericallyOtherBytesLiterally) {
     int order;
   };
   const Case cases[] = {
-      {"1.10", "1.9", 1},
-      {"2", "10", -1},
-      {"1.2.3", "1.2.3", 0},
-      {"1.0b", "1.0", 1},
-      {"1.0", "1.0.0", -1},
-      {"1.01", "1.1", 0},
-      {"007", "7", 0},
+      // clang-format off
+      {"1.10", "1.9", 1}, {"2", "10", -1}, {"1.2.3", "1.2.3", 0}, {"1.0b", "1.0", 1},
+      {"1.0", "1.0.0", -1}, {"1.01", "1.1", 0}, {"007", "7", 0}, {"1a2", "1a10", -1},
       {"1.0a", "1.0B", 1},  // case-sensitive: 'a' > 'B'
-      {"", "", 0},
-      {"", "0", -1},
+      {"", "", 0}, {"", "0", -1},
       {"99999999999999999999999999", "100000000000000000000000000", -1},
       {"1.99999999999999999999999999", "1.99999999999999999999999998", 1},
-      {"1a2", "1a10", -1},
+      // clang-format on
   };
   for (const Case& c : cases) {
     EXPECT_EQ(compareVersionString(c.a, c.b), c.order) << c.a << " vs " << c.b;

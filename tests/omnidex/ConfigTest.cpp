@@ -51,13 +51,12 @@ TEST(OmnidexConfig, SystemResidenceFollowsTheSystemVolume) {
     const char* path;
     bool resident;
   } cases[] = {
-      {nullptr, "/System/Library/PlugIns/p.appex", true},
-      {nullptr, "/System", false},
-      {nullptr, "/System/", false},
-      {nullptr, "/Systemic/p.appex", false},
-      {"/img/System", "/img/System/p.appex", true},
-      {"/img/System", "/System/p.appex", false},
+      // clang-format off
+      {nullptr, "/System/Library/PlugIns/p.appex", true}, {nullptr, "/System", false},
+      {nullptr, "/System/", false}, {nullptr, "/Systemic/p.appex", false},
+      {"/img/System", "/img/System/p.appex", true}, {"/img/System", "/System/p.appex", false},
       {"/img/System/", "/img/System/p.appex", true},
+      // clang-format on
   };
   for (const auto& c : cases) {
     ScopedEnvironment system("VANTREL_SYSTEM_DIR", c.system);

@@ -2,7 +2,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <fstream>
 
 #include "base/Log.h"
 #include "platform/PropertyList.h"
@@ -14,8 +13,8 @@ namespace {
 namespace fs = std::filesystem;
 using lmo::Dictionary;
 using lmo::Value;
+using testing::observe;
 using testing::plugInInfo;
-using testing::RecordingObserver;
 using testing::RegistryTree;
 using testing::writeBundle;
 
@@ -39,23 +38,25 @@ TEST(OmnidexMetadata, KeyedLookupReadsEachScopeAndInfoFallsBackToTheExtension) {
   const PlugInRecordPtr record = registry->plugInForUrl(path);
   const PlugInRecordPtr oldStyle = registry->plugInForUrl(old);
 
+  const PlugInRecord *k = record.get(), *o = oldStyle.get();
+  constexpr LookupScope kAttributes = LookupScope::kAttributes, kInfo = LookupScope::kInfo;
   const struct {
     const PlugInRecord* record;
     LookupScope scope;
     const char* key;
     Value expected;
   } cases[] = {
-      {record.get(), LookupScope::kAttributes, "Kind", "k"},
-      {record.get(), LookupScope::kAttributes, "Shared", "attribute"},
-      {record.get(), LookupScope::kAttributes, "QXExtensionPointIdentifier", Value()},
-      {record.get(), LookupScope::kExtension, "Shared", "extension"},
-      {record.get(), LookupScope::kExtension, "KBBundleIdentifier", Value()},
-      {record.get(), LookupScope::kInfo, "Shared", "info"},
-      {record.get(), LookupScope::kInfo, "QXExtensionPointIdentifier", "com.karvo.share"},
-      {record.get(), LookupScope::kInfo, "Absent", Value()},
-      {record.get(), static_cast<LookupScope>(7), "Shared", Value()},
-      {oldStyle.get(), LookupScope::kAttributes, "anything", Value()},
-      {oldStyle.get(), LookupScope::kInfo, "QXExtensionAttributes", "not a dictionary"},
+      // clang-format off
+      {k, kAttributes, "Kind", "k"}, {k, kAttributes, "Shared", "attribute"},
+      {k, kAttributes, "QXExtensionPointIdentifier", Value()},
+      {k, LookupScope::kExtension, "Shared", "extension"},
+      {k, LookupScope::kExtension, "KBBundleIdentifier", Value()},
+      {k, kInfo, "Shared", "info"}, {k, kInfo, "Absent", Value()},
+      {k, kInfo, "QXExtensionPointIdentifier", "com.karvo.share"},
+      {k, static_cast<LookupScope>(7), "Shared", Value()},
+      {o, kAttributes, "anything", Value()},
+      {o, kInfo, "QXExtensionAttributes", "not a dictionary"},
+      // clang-format on
   };
   for (const auto& c : cases) {
     EXPECT_EQ(c.record->keyed(c.key, c.scope), c.expected)
@@ -132,8 +133,7 @@ TEST(OmnidexMetadata, EntitlementsThatBecomeUntrustedAreDroppedAtTheNextReconcil
   const Dictionary granted{{"com.karvo.private.vantrel.manager", Value::boolean(true)}};
   ASSERT_TRUE(platform::writePropertyListFile(file, Value(granted), 0644).has_value());
   auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   registry->reconcile();
   const PlugInRecordPtr first = registry->plugInForUrl(path);
   ASSERT_EQ(first->entitlements, granted);

@@ -1,5 +1,7 @@
 #include "tests/omnidex/OmnidexFixtures.h"
 
+#include <sqlite3.h>
+
 #include <filesystem>
 
 #include "platform/PropertyList.h"
@@ -91,14 +93,18 @@ PlugInRecordPtr RecordingObserver::waitFor(bool installed, const std::string& pa
   return found;
 }
 
-PlugInRecordPtr RecordingObserver::waitForInstalled(const std::string& path,
-                                                    std::chrono::milliseconds timeout) {
-  return waitFor(true, path, timeout);
+std::shared_ptr<RecordingObserver> observe(Omnidex& registry) {
+  auto observer = std::make_shared<RecordingObserver>();
+  registry.addObserver(observer);
+  return observer;
 }
 
-PlugInRecordPtr RecordingObserver::waitForUninstalled(const std::string& path,
-                                                      std::chrono::milliseconds timeout) {
-  return waitFor(false, path, timeout);
+void runSql(const std::string& path, const std::string& sql) {
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
+  EXPECT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
+      << sqlite3_errmsg(db);
+  sqlite3_close(db);
 }
 
 }  // namespace vantrel::omnidex::testing

@@ -36,6 +36,10 @@ class RegistryTree {
   std::string apps() const { return temp_.file("apps"); }
   std::string plugIns() const { return temp_.file("plugins"); }
   std::string file(const std::string& relative) const { return temp_.file(relative); }
+  // Writes text to file(relative), making its directories; returns the path.
+  std::string write(const std::string& relative, const std::string& text) const {
+    return temp_.write(relative, text);
+  }
   OmnidexConfig config() const;
   // Opens the registry on config(); fails the test when it cannot.
   std::shared_ptr<Omnidex> open() const;
@@ -58,13 +62,17 @@ class RecordingObserver : public WorkspaceObserver {
 
   std::vector<Event> events() const;
   void clear();
-  // Waits (polling the recorded events, never only sleeping) until a record
-  // with that bundle path has been announced installed / uninstalling, or
-  // the timeout passes. The record announced, or null.
+  // Waits (on the recorded events, never only sleeping) until a record with
+  // that bundle path has been announced installed / uninstalling, or the
+  // timeout passes. The record announced, or null.
   PlugInRecordPtr waitForInstalled(const std::string& path,
-                                   std::chrono::milliseconds timeout = std::chrono::seconds(5));
+                                   std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
+    return waitFor(true, path, timeout);
+  }
   PlugInRecordPtr waitForUninstalled(const std::string& path,
-                                     std::chrono::milliseconds timeout = std::chrono::seconds(5));
+                                     std::chrono::milliseconds timeout = std::chrono::seconds(5)) {
+    return waitFor(false, path, timeout);
+  }
   // Bundle paths announced so far, in order, as "+path" / "-path".
   std::vector<std::string> log() const;
 
@@ -75,5 +83,11 @@ class RecordingObserver : public WorkspaceObserver {
   std::condition_variable changed_;
   std::vector<Event> events_;  // Guarded by mutex_.
 };
+
+// A recording observer, added to registry.
+std::shared_ptr<RecordingObserver> observe(Omnidex& registry);
+
+// Runs sql on the SQLite database at path; a failure fails the test.
+void runSql(const std::string& path, const std::string& sql);
 
 }  // namespace vantrel::omnidex::testing

@@ -1,5 +1,3 @@
-#include <sqlite3.h>
-
 #include <chrono>
 #include <thread>
 
@@ -79,10 +77,7 @@ TEST(PrivacyConsent, AStoreMadeBeforeTheTableOpensAndGainsIt) {
   const std::string bundle = testing::writeBundle(
       tree.file("elsewhere/Keys.plugin"), testing::plugInInfo("com.example.keys", "com.karvo.p"));
   auto runSql = [&](const char* sql) {
-    sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(tree.file("state/" + std::string(kStoreFileName)).c_str(), &db), 0);
-    EXPECT_EQ(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK) << sqlite3_errmsg(db);
-    sqlite3_close(db);
+    testing::runSql(tree.file("state/" + std::string(kStoreFileName)), sql);
   };
   auto registry = tree.open();
   ASSERT_TRUE(registry && registry->registerPlugIn(bundle).has_value());

@@ -1,5 +1,3 @@
-#include <sqlite3.h>
-
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -15,9 +13,10 @@ namespace {
 namespace fs = std::filesystem;
 using lmo::Dictionary;
 using lmo::Value;
+using testing::observe;
 using testing::plugInInfo;
-using testing::RecordingObserver;
 using testing::RegistryTree;
+using testing::runSql;
 using testing::writeBundle;
 
 std::map<std::string, base::Uuid> uuidsByPath(Workspace& registry) {
@@ -34,14 +33,8 @@ std::string readFile(const std::string& path) {
   return s.str();
 }
 
-void runSql(const std::string& db, const std::string& sql) {
-  sqlite3* handle = nullptr;
-  ASSERT_EQ(sqlite3_open(db.c_str(), &handle), SQLITE_OK);
-  EXPECT_EQ(sqlite3_exec(handle, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
-      << sqlite3_errmsg(handle);
-  sqlite3_close(handle);
-}
-
+// Also: a plug-in registered explicitly, outside the directories scanned,
+// survives restarts until its bundle goes.
 TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   RegistryTree tree;
   const std::string notes = tree.apps() + "/Notes.app";
@@ -58,12 +51,12 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   fs::create_symlink(outside, tree.plugIns() + "/Linked.plugin");
   writeBundle(tree.apps() + "/Linky.app", Dictionary{});
   fs::create_symlink(tree.file("outside"), tree.apps() + "/Linky.app/PlugIns");
+  const std::string away = writeBundle(tree.file("away/Away.plugin"), plugInInfo("away", "p"));
 
   std::map<std::string, base::Uuid> before;
   {
     auto registry = tree.open();
-    auto observer = std::make_shared<RecordingObserver>();
-    registry->addObserver(observer);
+    auto observer = observe(*registry);
     base::LogCapture log;
     registry->reconcile();
     // reconcile() returns once its announcements are delivered.
@@ -71,9 +64,10 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
     EXPECT_EQ(log.count("skipping bundle: the plug-in at " + broken +
                         " has no identifier (no QXExtensionIdentifier, nor KBBundleIdentifier)"),
               1u);
+    ASSERT_TRUE(registry->registerPlugIn(away).has_value());
     before = uuidsByPath(*registry);
   }
-  ASSERT_EQ(before.size(), 3u);
+  ASSERT_EQ(before.size(), 4u);
 
   fs::remove_all(widget);
   writeBundle(share, plugInInfo("n.share", "p", Dictionary{{"KBBundleVersion", "2"}}));
@@ -82,8 +76,7 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   auto registry = tree.open();
   // Until it reconciles, the registry answers from its store.
   EXPECT_EQ(uuidsByPath(*registry), before);
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   registry->reconcile();
   EXPECT_EQ(observer->log(),
             (std::vector<std::string>{"-" + share, "-" + widget, "+" + share, "+" + added}));
@@ -91,6 +84,7 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   EXPECT_EQ(after.count(widget), 0u);
   EXPECT_EQ(after[share], before[share]);
   EXPECT_EQ(after[tool], before[tool]);
+  EXPECT_EQ(after[away], before[away]);
   EXPECT_EQ(registry->plugInForUrl(share)->bundleVersion, "2");
   EXPECT_FALSE(fs::exists(tree.container(before[widget])));
   EXPECT_TRUE(fs::exists(tree.container(before[share])));
@@ -98,34 +92,12 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   observer->clear();
   registry->reconcile();
   EXPECT_TRUE(observer->events().empty());
-}
 
-TEST(OmnidexReconcile, ExplicitRegistrationsSurviveRestartsUntilTheirBundleGoes) {
-  RegistryTree tree;
-  const std::string away = writeBundle(tree.file("away/Away.plugin"), plugInInfo("away", "p"));
-  base::Uuid uuid;
-  {
-    auto registry = tree.open();
-    ASSERT_TRUE(registry->registerPlugIn(away).has_value());
-    uuid = registry->plugInForUrl(away)->uuid;
-  }
-  {
-    auto registry = tree.open();
-    auto observer = std::make_shared<RecordingObserver>();
-    registry->addObserver(observer);
-    registry->reconcile();
-    ASSERT_NE(registry->plugInForUrl(away), nullptr);
-    EXPECT_EQ(registry->plugInForUrl(away)->uuid, uuid);
-    EXPECT_TRUE(observer->events().empty());
-  }
   fs::remove_all(away);
-  auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
   registry->reconcile();
-  EXPECT_EQ(registry->plugInForUuid(uuid), nullptr);
+  EXPECT_EQ(registry->plugInForUuid(before[away]), nullptr);
   EXPECT_EQ(observer->log(), std::vector<std::string>{"-" + away});
-  EXPECT_FALSE(fs::exists(tree.container(uuid)));
+  EXPECT_FALSE(fs::exists(tree.container(before[away])));
 }
 
 TEST(OmnidexReconcile, ApplicationChangesReachItsPlugIns) {
@@ -133,8 +105,7 @@ TEST(OmnidexReconcile, ApplicationChangesReachItsPlugIns) {
   const std::string app = tree.apps() + "/Late.app";
   const std::string plugIn = writeBundle(app + "/PlugIns/P.appex", plugInInfo("late.p", "p"));
   auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   registry->reconcile();
   const PlugInRecordPtr first = registry->plugInForUrl(plugIn);
   ASSERT_NE(first, nullptr);
@@ -175,13 +146,9 @@ TEST(OmnidexReconcile, RefusesDatabasesItCannotReadAndLeavesThemAlone) {
   };
   for (const auto& c : cases) {
     RegistryTree tree;
-    fs::create_directories(tree.state());
-    const std::string db = tree.state() + "/registry.sqlite3";
-    if (c.sql.empty()) {
-      std::ofstream(db) << std::string(4096, 'x');
-    } else {
-      runSql(db, c.sql);
-    }
+    const std::string db =
+        tree.write("state/registry.sqlite3", c.sql.empty() ? std::string(4096, 'x') : "");
+    if (!c.sql.empty()) runSql(db, c.sql);
     const std::string bytes = readFile(db);
     base::Result<std::shared_ptr<Omnidex>> opened = Omnidex::open(tree.config());
     ASSERT_FALSE(opened.has_value()) << c.name;

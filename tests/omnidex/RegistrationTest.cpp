@@ -1,7 +1,6 @@
 #include <sys/stat.h>
 
 #include <filesystem>
-#include <fstream>
 
 #include "omnidex/BundlePaths.h"
 #include "omnidex/Errors.h"
@@ -13,8 +12,8 @@ namespace {
 namespace fs = std::filesystem;
 using lmo::Dictionary;
 using lmo::Value;
+using testing::observe;
 using testing::plugInInfo;
-using testing::RecordingObserver;
 using testing::RegistryTree;
 using testing::writeBundle;
 
@@ -26,8 +25,7 @@ bool isPrivateDirectory(const std::string& path) {
 TEST(OmnidexRegistration, RegisterReadsTheBundleAndUnregisterForgetsIt) {
   RegistryTree tree;
   auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   const Dictionary extras{
       {"KBBundleDisplayName", "Sharing"}, {"KBBundleName", "Share"}, {"KBBundleVersion", "7"}};
   Dictionary info = plugInInfo("com.example.share", "com.karvo.share", extras);
@@ -83,15 +81,12 @@ TEST(OmnidexRegistration, RefusesWhatIsNotAPlugInAndKeepsNothing) {
   writeBundle(tree.file("extension-not-dict"),
               Dictionary{{"KBBundleIdentifier", "x"}, {"QXExtension", "text"}});
   fs::create_directories(tree.file("no-info"));
-  fs::create_directories(tree.file("array-info"));
-  std::ofstream(tree.file("array-info/Info.plist"))
-      << "<?xml version=\"1.0\"?><plist version=\"1.0\"><array/></plist>";
-  fs::create_directories(tree.file("garbage-info"));
-  std::ofstream(tree.file("garbage-info/Info.plist")) << "<plist><dict><key>x";
   fs::create_directories(tree.file("info-is-dir/Info.plist"));
-  std::ofstream(tree.file("plain-file")) << "x";
-  fs::create_directories(tree.file("huge-info"));
-  std::ofstream(tree.file("huge-info/Info.plist")) << std::string(2 * 1024 * 1024, ' ');
+  tree.write("array-info/Info.plist",
+             "<?xml version=\"1.0\"?><plist version=\"1.0\"><array/></plist>");
+  tree.write("garbage-info/Info.plist", "<plist><dict><key>x");
+  tree.write("plain-file", "x");
+  tree.write("huge-info/Info.plist", std::string(2 * 1024 * 1024, ' '));
 
   const struct {
     std::string path;
@@ -126,8 +121,7 @@ TEST(OmnidexRegistration, RefusesWhatIsNotAPlugInAndKeepsNothing) {
 TEST(OmnidexRegistration, UuidFollowsThePathWhileTheIdentifierStays) {
   RegistryTree tree;
   auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   const std::string path = writeBundle(tree.file("x/Tool.plugin"), plugInInfo("com.t", "p"));
   ASSERT_TRUE(registry->registerPlugIn(path).has_value());
   const PlugInRecordPtr first = registry->plugInForUrl(path);
@@ -211,15 +205,12 @@ TEST(OmnidexRegistration, ContainingApplicationPathIsLexical) {
     const char* path;
     const char* app;  // null: none
   } cases[] = {
-      {"/a/X.app/PlugIns/P.appex", "/a/X.app"},
-      {"/X.app/PlugIns/P", "/X.app"},
-      {"/a/X.app/PlugIns", nullptr},
-      {"/a/.app/PlugIns/P", nullptr},
-      {"/a/X.appx/PlugIns/P", nullptr},
-      {"/a/X.app/plugins/P", nullptr},
-      {"/a/X.app/PlugIns/P/PlugIns/Q", nullptr},
-      {"PlugIns/P", nullptr},
-      {"/", nullptr},
+      // clang-format off
+      {"/a/X.app/PlugIns/P.appex", "/a/X.app"}, {"/X.app/PlugIns/P", "/X.app"},
+      {"/a/X.app/PlugIns", nullptr}, {"/a/.app/PlugIns/P", nullptr},
+      {"/a/X.appx/PlugIns/P", nullptr}, {"/a/X.app/plugins/P", nullptr},
+      {"/a/X.app/PlugIns/P/PlugIns/Q", nullptr}, {"PlugIns/P", nullptr}, {"/", nullptr},
+      // clang-format on
   };
   for (const auto& c : cases) {
     std::optional<std::string> app = containingApplicationPath(c.path);

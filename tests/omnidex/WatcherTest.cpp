@@ -12,6 +12,7 @@ namespace {
 namespace fs = std::filesystem;
 using lmo::Dictionary;
 using lmo::Value;
+using testing::observe;
 using testing::plugInInfo;
 using testing::RecordingObserver;
 using testing::RegistryTree;
@@ -53,8 +54,7 @@ bool eventually(Predicate predicate, std::chrono::milliseconds timeout = kAnnoun
 TEST(OmnidexWatcher, ApplicationsCopiedInAndDeletedAreAnnounced) {
   RegistryTree tree;
   auto registry = tree.open();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   registry->startMonitoring();
 
   // Moved into place in one rename.
@@ -98,8 +98,7 @@ TEST(OmnidexWatcher, StandAlonePlugInChangesAndLateRootsAreFollowed) {
   const std::string lateRoot = tree.file("late-apps");  // does not exist yet
   config.applicationDirectories.push_back(lateRoot);
   auto registry = Omnidex::open(config).value();
-  auto observer = std::make_shared<RecordingObserver>();
-  registry->addObserver(observer);
+  auto observer = observe(*registry);
   registry->startMonitoring();
 
   const std::string tool = writeBundle(tree.plugIns() + "/Tool.plugin", plugInInfo("tool", "p"));

@@ -7,11 +7,11 @@
 #include <algorithm>
 #include <atomic>
 #include <cstdlib>
-#include <map>
 #include <set>
 
 #include "omnidex/Workspace.h"
 #include "registry/VTDatabase.h"
+#include "tests/support/ScopedEnvironment.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::registry::testing {
@@ -61,10 +61,8 @@ struct CountingDelegate : VTDatabaseDelegate {
 class FakeWorkspace : public omnidex::Workspace {
  public:
   std::vector<PlugInRecordPtr> records;
-  // Privacy-consent answers by application bundle identifier.
-  std::map<std::string, std::vector<omnidex::ConsentEntry>> consent;
-  bool failing = false;
-  int cacheClears = 0;  // changed on the database queue only
+  bool failing = false;  // every listing answers nullopt
+  int cacheClears = 0;   // changed on the database queue only
 
   void addObserver(std::weak_ptr<omnidex::WorkspaceObserver>) override {}
   void startMonitoring() override {}
@@ -88,10 +86,8 @@ class FakeWorkspace : public omnidex::Workspace {
   base::Result<void> unregisterPlugIn(const std::string&) override { return ok(); }
   void clearCaches() override { ++cacheClears; }
   std::optional<std::vector<omnidex::ConsentEntry>> privacyConsentEntries(
-      const std::string& appBundleIdentifier) override {
-    if (failing) return std::nullopt;
-    auto found = consent.find(appBundleIdentifier);
-    return found == consent.end() ? std::vector<omnidex::ConsentEntry>() : found->second;
+      const std::string&) override {
+    return failing ? std::nullopt : std::optional(std::vector<omnidex::ConsentEntry>());
   }
 
  private:
@@ -104,28 +100,22 @@ class FakeWorkspace : public omnidex::Workspace {
 };
 
 // Points the runtime, state and annotation directories into a temporary
-// directory, and restores the environment afterwards.
+// directory, and restores the environment (HOME included) afterwards.
 class RegistryTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    for (const char* name : {"VANTREL_RUNTIME_DIR", "VANTREL_STATE_DIR", "XDG_STATE_HOME", "HOME"})
-      saved_[name] =
-          std::getenv(name) ? std::optional<std::string>(std::getenv(name)) : std::nullopt;
-    ::setenv("VANTREL_RUNTIME_DIR", tmp_.file("run").c_str(), 1);
-    ::setenv("VANTREL_STATE_DIR", tmp_.file("state").c_str(), 1);
-    ::setenv("XDG_STATE_HOME", tmp_.file("xdg").c_str(), 1);
-  }
-  void TearDown() override {
-    for (const auto& [name, value] : saved_)
-      value ? ::setenv(name.c_str(), value->c_str(), 1) : ::unsetenv(name.c_str());
-  }
   VTDatabasePtr database() {
     return VTDatabase::initWithDatabase(tmp_.file("Annotations"), workspace_);
   }
 
   vantrel::testing::TempDir tmp_;
   std::shared_ptr<FakeWorkspace> workspace_ = std::make_shared<FakeWorkspace>();
-  std::map<std::string, std::optional<std::string>> saved_;
+
+ private:
+  using Env = vantrel::testing::ScopedEnvironment;
+  Env runtime_{"VANTREL_RUNTIME_DIR", tmp_.file("run")};
+  Env state_{"VANTREL_STATE_DIR", tmp_.file("state")};
+  Env xdg_{"XDG_STATE_HOME", tmp_.file("xdg")};
+  Env home_{"HOME", std::getenv("HOME")};
 };
 
 }  // namespace vantrel::registry::testing

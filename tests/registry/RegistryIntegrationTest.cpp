@@ -9,7 +9,6 @@
 #include "base/Format.h"
 #include "base/Log.h"
 #include "omnidex/Omnidex.h"
-#include "platform/NotificationCenter.h"
 #include "registry/VTDatabase.h"
 #include "tests/registry/RegistryFixtures.h"
 
@@ -38,10 +37,7 @@ TEST_F(RegistryIntegration, DiscoverElectAndUnregister) {
                             name, name));
   }
 
-  omnidex::OmnidexConfig config;
-  config.stateDirectory = tmp_.file("state");
-  config.applicationDirectories = {tmp_.file("apps")};
-  auto registry = omnidex::Omnidex::open(config);
+  auto registry = omnidex::Omnidex::open({tmp_.file("state"), {tmp_.file("apps")}, {}});
   ASSERT_TRUE(registry.has_value()) << registry.error().description();
   base::LogCapture log;
   auto db = VTDatabase::initWithDatabase(tmp_.file("Annotations"), registry.value());
@@ -63,7 +59,6 @@ TEST_F(RegistryIntegration, DiscoverElectAndUnregister) {
 
   EXPECT_EQ(identifiers(db->findPlugIns(elected)), Names{});
   db->setAnnotation(testing::election(1), *widget);
-  EXPECT_EQ(platform::notificationCount(kAnnotationChangeNotification), 1u);
   found = db->findPlugIns(elected);
   ASSERT_EQ(identifiers(found), (Names{"com.x.widget"}));
   EXPECT_EQ(found->front(), widget);  // the cached object
