@@ -2,9 +2,11 @@
 // rules, that the host may use and that the user has not excluded, one form
 // per identifier unless the flags ask for more.
 
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "base/Log.h"
@@ -23,9 +25,9 @@ namespace vantrel::daemon {
 // list see the same object when step 7 marks replaced and replacing forms.
 struct Form {
   lmo::Dictionary body;
-  std::string identifier() const {
+  std::string_view identifier() const {
     const std::string* id = body.get("identifier").getIfString();
-    return id ? *id : std::string();
+    return id ? std::string_view(*id) : std::string_view();
   }
 };
 using FormPtr = std::shared_ptr<Form>;
@@ -34,7 +36,7 @@ struct MatchState {
   uint64_t flags = 0;
   std::vector<FormPtr> results;
   // Replaced identifier -> the form of the plug-in that replaces it.
-  std::map<std::string, FormPtr> replacements;
+  std::map<std::string, FormPtr, std::less<>> replacements;
   lmo::Array exclusions;
 };
 
@@ -184,7 +186,7 @@ void Transaction::matchPlugIns() {
     if (replacing == state.replacements.end()) continue;
     form->body = form->body.setting("overrider", replacing->second->body.get("uuid"));
     replacing->second->body =
-        replacing->second->body.setting("overriding", lmo::Value(form->identifier()));
+        replacing->second->body.setting("overriding", lmo::Value(std::string(form->identifier())));
   }
   std::vector<lmo::Value> forms;
   forms.reserve(state.results.size());

@@ -148,15 +148,6 @@ int errorNumber(const base::Error& error) {
              : EIO;
 }
 
-std::optional<base::Error> executableProblem(const std::string& path) {
-  struct stat st;
-  if (::stat(path.c_str(), &st) != 0) return posixError(errno, "no executable at", path);
-  if (!S_ISREG(st.st_mode) || (st.st_mode & (S_IXUSR | S_IXGRP | S_IXOTH)) == 0) {
-    return posixError(EACCES, "cannot execute", path);
-  }
-  return std::nullopt;
-}
-
 // ---- The table file ----
 
 lmo::Value encode(const std::vector<ExternalServiceRegistration>& table) {
@@ -249,6 +240,15 @@ bool isEnvironmentName(std::string_view name) {
 }
 
 }  // namespace
+
+std::optional<base::Error> executableProblem(const std::string& path) {
+  struct stat st;
+  if (::stat(path.c_str(), &st) != 0) return posixError(errno, "no executable at", path);
+  if (!S_ISREG(st.st_mode) || (st.st_mode & (S_IXUSR | S_IXGRP | S_IXOTH)) == 0) {
+    return posixError(EACCES, "cannot execute", path);
+  }
+  return std::nullopt;
+}
 
 std::string launchDirectoryPath(const std::string& directory, pid_t pid) {
   return base::format("%@/%s/%d", directory, kServicesDirectoryName, static_cast<int>(pid));

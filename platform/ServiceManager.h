@@ -103,6 +103,11 @@ struct LaunchDescription {
   std::optional<std::string> workingDirectory;
 };
 
+// Why path cannot be a service's executable: missing (the stat's errno), or
+// not a regular file with an execute bit (EACCES); domain "POSIX". nullopt
+// when it can be.
+std::optional<base::Error> executableProblem(const std::string& path);
+
 // <directory>/services/<pid>
 std::string launchDirectoryPath(const std::string& directory, pid_t pid);
 // <directory>/services/<pid>/<bundleIdentifier>.plist

@@ -2,9 +2,6 @@
 // plug-in registered as a service the host's process may launch, with its
 // environment and sandbox profile.
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -24,11 +21,6 @@ constexpr std::string_view kExtensionPointKey = "QXExtensionPointIdentifier";
 constexpr std::string_view kServiceKey = "LMOService";
 constexpr std::string_view kEnvironmentKey = "EnvironmentVariables";
 constexpr const char* kTestSdkVariable = "VTTEST_SDK";
-
-bool isExecutableFile(const std::string& path) {
-  struct stat st {};
-  return ::stat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode) && ::access(path.c_str(), X_OK) == 0;
-}
 
 // The sandbox profile of a plug-in, by its extension point.
 const char* sandboxProfileFor(const VTDPlugIn& plugIn) {
@@ -118,7 +110,7 @@ std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) con
   // The bundle service answers the bundle's own path when it names no
   // executable: only a regular, executable file will do.
   const std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
-  if (!executable || !isExecutableFile(*executable)) {
+  if (!executable || platform::executableProblem(*executable)) {
     return base::error_with_code_and_format(base::kErrorBadRequest,
                                             "cannot obtain executable path for plug-in %@(%@)",
                                             identifier(), uuidText);
