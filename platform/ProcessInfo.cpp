@@ -114,4 +114,28 @@ bool sharesMountNamespace(pid_t pid) {
   return ours && theirs && *ours == *theirs;
 }
 
+std::optional<std::string> readProcessStatus(pid_t pid) {
+  SmallFileRead r =
+      readSmallFile(base::format("/proc/%d/status", static_cast<int>(pid)), kMaxProcessStatusBytes);
+  if (smallFileProblem(r, kMaxProcessStatusBytes)) return std::nullopt;
+  return std::move(r.bytes);
+}
+
+std::optional<std::string_view> processStatusField(std::string_view status,
+                                                   std::string_view field) {
+  constexpr std::string_view kBlanks = " \t";
+  for (size_t at = 0; at < status.size();) {
+    const size_t end = std::min(status.find('\n', at), status.size());
+    std::string_view line = status.substr(at, end - at);
+    if (line.substr(0, field.size()) == field) {
+      line.remove_prefix(field.size());
+      const size_t first = line.find_first_not_of(kBlanks);
+      if (first == std::string_view::npos) return std::string_view();
+      return line.substr(first, line.find_last_not_of(kBlanks) - first + 1);
+    }
+    at = end + 1;
+  }
+  return std::nullopt;
+}
+
 }  // namespace vantrel::platform

@@ -8,6 +8,7 @@
 #include <cstddef>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "base/Result.h"
 
@@ -49,6 +50,21 @@ std::optional<FileIdentity> fileIdentity(const std::string& path);
 // ESRCH when the process has exited (a zombie may still pass) or the pidfd
 // stands for another pid, EBADF when the descriptor is not a pidfd.
 base::Result<void> checkProcessIdentity(pid_t pid, int pidfd);
+
+// Largest /proc/<pid>/status read; the supplementary group list makes it
+// grow. A larger one reads as none.
+inline constexpr size_t kMaxProcessStatusBytes = 256 * 1024;
+
+// The text of /proc/<pid>/status; nullopt when it cannot be read or exceeds
+// kMaxProcessStatusBytes. A snapshot like the rest: check the process's
+// identity around it where that matters.
+std::optional<std::string> readProcessStatus(pid_t pid);
+
+// The value of the first line "<field> <value>" of a status text, without
+// the blanks around it; nullopt when no line starts with field. The kernel
+// escapes newlines in the one free-text field (Name), so a process cannot
+// forge a line of its own.
+std::optional<std::string_view> processStatusField(std::string_view status, std::string_view field);
 
 // Whether pid runs in the mount namespace of this process. False when that
 // cannot be told.

@@ -11,18 +11,14 @@
 
 namespace vantrel::platform {
 
-// Largest /proc/<pid>/status read. A process whose status is larger (tens of
-// thousands of supplementary groups) counts as sandboxed.
-inline constexpr size_t kMaxProcessStatusBytes = 64 * 1024;
-
 // Whether the process pid, named by pidfd (taken when it connected), is
 // sandboxed: its status shows "NoNewPrivs: 1" or a "Seccomp" mode other
 // than 0. Whenever that cannot be told, the answer is true, so that the
 // caller refuses what it would grant only to an unconfined process: pidfd
 // does not stand for pid before or after the read (the process exited, or
 // the pid went to another process mid-read), the process is a zombie, the
-// status cannot be read, exceeds kMaxProcessStatusBytes, or lacks either
-// field, or a field is not a decimal number.
+// status cannot be read (readProcessStatus, platform/ProcessInfo.h) or lacks
+// either field, or a field is not a decimal number.
 bool processIsSandboxed(pid_t pid, int pidfd);
 
 }  // namespace vantrel::platform

@@ -24,7 +24,6 @@
 #include "platform/ProcessInfo.h"
 #include "platform/PropertyList.h"
 #include "platform/ScopedFd.h"
-#include "platform/SmallFile.h"
 
 namespace vantrel::platform {
 namespace {
@@ -69,22 +68,6 @@ std::string pidText(pid_t pid) {
 
 // ---- Reading /proc ----
 
-// The text after "<field>" on the line that starts with it, leading blanks
-// skipped; nullopt when no line does.
-std::optional<std::string_view> fieldValue(std::string_view text, std::string_view field) {
-  for (size_t at = 0; at < text.size();) {
-    const size_t end = std::min(text.find('\n', at), text.size());
-    std::string_view line = text.substr(at, end - at);
-    if (line.substr(0, field.size()) == field) {
-      line.remove_prefix(field.size());
-      while (!line.empty() && (line.front() == ' ' || line.front() == '\t')) line.remove_prefix(1);
-      return line;
-    }
-    at = end + 1;
-  }
-  return std::nullopt;
-}
-
 // The index-th blank-separated number of text.
 std::optional<long> numberAt(std::string_view text, int index) {
   const char* p = text.data();
@@ -117,11 +100,10 @@ struct Owner {
 
 // The effective uid and gid of pid from /proc/<pid>/status.
 std::optional<Owner> processOwner(pid_t pid) {
-  const SmallFileRead r =
-      readSmallFile(base::format("/proc/%d/status", static_cast<int>(pid)), kMaxProcessStatusBytes);
-  if (smallFileProblem(r, kMaxProcessStatusBytes)) return std::nullopt;
-  const std::optional<std::string_view> uids = fieldValue(r.bytes, kUidField);
-  const std::optional<std::string_view> gids = fieldValue(r.bytes, kGidField);
+  const std::optional<std::string> status = readProcessStatus(pid);
+  if (!status) return std::nullopt;
+  const std::optional<std::string_view> uids = processStatusField(*status, kUidField);
+  const std::optional<std::string_view> gids = processStatusField(*status, kGidField);
   const std::optional<long> uid = uids ? numberAt(*uids, 1) : std::nullopt;
   const std::optional<long> gid = gids ? numberAt(*gids, 1) : std::nullopt;
   if (!uid || !gid || *uid < 0 || *gid < 0) return std::nullopt;

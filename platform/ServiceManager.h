@@ -58,9 +58,6 @@ inline constexpr size_t kMaxPublishedBundleIdentifierLength = 249;
 // the directory and may fill it; beyond this the directory stays, with a
 // log line.
 inline constexpr size_t kMaxLaunchDirectoryEntries = 1024;
-// Largest /proc/<pid>/status read to learn a host's uid and gid (the
-// supplementary group list makes it grow).
-inline constexpr size_t kMaxProcessStatusBytes = 256 * 1024;
 
 // Keys of a launch description file.
 inline constexpr const char* kLaunchFormatVersionKey = "formatVersion";
