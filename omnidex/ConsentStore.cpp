@@ -84,19 +84,13 @@ base::Error ConsentStore::failure(const char* what) const {
 base::Result<void> ConsentStore::prepare() {
   // Store::open has created or checked the database; this only guards
   // against being opened on something else, which must not be written to.
-  sqlite3_stmt* version = nullptr;
-  if (sqlite3_prepare_v2(db_, "PRAGMA user_version", -1, &version, nullptr) != SQLITE_OK) {
-    return failure("cannot open");
-  }
-  const int rc = sqlite3_step(version);
-  const int64_t found = rc == SQLITE_ROW ? sqlite3_column_int64(version, 0) : -1;
-  sqlite3_finalize(version);
-  if (rc != SQLITE_ROW) return failure("cannot open");
-  if (found != kStoreSchemaVersion) {
+  const std::optional<int64_t> found = queryInteger(db_, "PRAGMA user_version");
+  if (!found) return failure("cannot open");
+  if (*found != kStoreSchemaVersion) {
     return omnidexError(kOmnidexSchemaMismatch,
                         base::format("the application registry at %@ has schema version %d; "
                                      "the privacy-consent table needs version %d",
-                                     path_, found, kStoreSchemaVersion));
+                                     path_, *found, kStoreSchemaVersion));
   }
   // Per connection; the database's write-ahead log mode is already set.
   if (sqlite3_exec(db_, "PRAGMA synchronous=NORMAL", nullptr, nullptr, nullptr) != SQLITE_OK ||
@@ -150,9 +144,7 @@ base::Result<std::vector<ConsentEntry>> ConsentStore::entries(const std::string&
   sqlite3_bind_int64(select_, 2, static_cast<sqlite3_int64>(kMaxConsentEntriesPerApplication));
   int rc;
   while ((rc = sqlite3_step(select_)) == SQLITE_ROW) {
-    const unsigned char* text = sqlite3_column_text(select_, 0);
-    const std::string service(text != nullptr ? reinterpret_cast<const char*>(text) : "",
-                              static_cast<size_t>(sqlite3_column_bytes(select_, 0)));
+    const std::string service = columnText(select_, 0);
     if (!usableIdentifier(service)) continue;
     found.push_back(ConsentEntry{service, sqlite3_column_int64(select_, 1) != 0,
                                  lmo::Date{sqlite3_column_double(select_, 2)}});

@@ -54,13 +54,6 @@ class Statement {
   sqlite3_stmt* s_;
 };
 
-std::string columnText(sqlite3_stmt* s, int i) {
-  const unsigned char* text = sqlite3_column_text(s, i);
-  if (text == nullptr) return {};
-  return std::string(reinterpret_cast<const char*>(text),
-                     static_cast<size_t>(sqlite3_column_bytes(s, i)));
-}
-
 std::optional<std::string> columnBlob(sqlite3_stmt* s, int i) {
   if (sqlite3_column_type(s, i) == SQLITE_NULL) return std::nullopt;
   const void* blob = sqlite3_column_blob(s, i);
@@ -107,26 +100,14 @@ base::Result<void> Store::execute(const char* sql) {
 base::Result<void> Store::prepare() {
   // The version is checked before anything is written: a database of another
   // version (or another program) is left exactly as it was found.
-  int64_t version = 0;
+  const std::optional<int64_t> stored = queryInteger(db_, "PRAGMA user_version");
+  if (!stored) return failure("cannot open");
+  const int64_t version = *stored;
   int64_t objects = 0;
-  {
-    sqlite3_stmt* raw = nullptr;
-    if (sqlite3_prepare_v2(db_, "PRAGMA user_version", -1, &raw, nullptr) != SQLITE_OK) {
-      return failure("cannot open");
-    }
-    Statement s(raw);
-    if (sqlite3_step(s.get()) != SQLITE_ROW) return failure("cannot open");
-    version = sqlite3_column_int64(s.get(), 0);
-  }
   if (version == 0) {
-    sqlite3_stmt* raw = nullptr;
-    if (sqlite3_prepare_v2(db_, "SELECT count(*) FROM sqlite_master", -1, &raw, nullptr) !=
-        SQLITE_OK) {
-      return failure("cannot open");
-    }
-    Statement s(raw);
-    if (sqlite3_step(s.get()) != SQLITE_ROW) return failure("cannot open");
-    objects = sqlite3_column_int64(s.get(), 0);
+    const std::optional<int64_t> count = queryInteger(db_, "SELECT count(*) FROM sqlite_master");
+    if (!count) return failure("cannot open");
+    objects = *count;
   }
   if (version != kStoreSchemaVersion && !(version == 0 && objects == 0)) {
     return omnidexError(kOmnidexSchemaMismatch,
