@@ -21,7 +21,7 @@ void Transaction::accessPlugIns() {
     errno = 0;
     std::optional<std::string> token = bundle ? model::issue_read_extension(*bundle) : std::nullopt;
     if (!token) {
-      failMessage(base::kErrorBadRequest,
+      failMessage(protocol::kErrorBadRequest,
                   base::format("cannot create extension to %@: %d", plugIn->path(), errno));
       return false;
     }
@@ -29,7 +29,7 @@ void Transaction::accessPlugIns() {
     return true;
   });
   if (!issued) return;
-  setReplyValue("extensions", lmo::Array(std::move(tokens)));
+  setReplyValue(protocol::kKeyExtensions, lmo::Array(std::move(tokens)));
   done();
 }
 
@@ -45,7 +45,7 @@ void Transaction::readyPlugIns() {
     if (server()->holdOnPlugIn(*plugIn)) {
       server()->debug("denied access to pid %d for plugin %@(%@): the plug-in is on hold", pid,
                       plugIn->identifier(), uuidText);
-      failMessage(base::kErrorAccessDenied,
+      failMessage(protocol::kErrorAccessDenied,
                   base::format("access to plugin %@ denied: %@", plugIn->identifier(),
                                "the plug-in is on hold"));
       return false;
@@ -54,7 +54,7 @@ void Transaction::readyPlugIns() {
     if (std::optional<std::string> reason = plugIn->allowForClient(*client())) {
       server()->debug("denied access to pid %d for plugin %@(%@): %@", pid, plugIn->identifier(),
                       uuidText, *reason);
-      failMessage(base::kErrorAccessDenied,
+      failMessage(protocol::kErrorAccessDenied,
                   base::format("access to plugin %@ denied: %@", plugIn->identifier(), *reason));
       return false;
     }

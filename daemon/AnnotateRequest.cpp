@@ -6,40 +6,34 @@
 #include "daemon/VTDLmoClient.h"
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::daemon {
 
-namespace {
-
-constexpr const char* kElectionKey = "election";
-constexpr const char* kExtensionKey = "extension";
-
-}  // namespace
-
 void Transaction::annotatePlugIns() {
   const std::optional<lmo::Dictionary> annotations =
-      lmo::lmo_dictionary_get_dictionary(request(), "annotations");
+      lmo::lmo_dictionary_get_dictionary(request(), protocol::kKeyAnnotations);
   if (!annotations) {
-    failMessage(base::kErrorBadRequest, "invalid request format (bad annotations dictionary)");
+    failMessage(protocol::kErrorBadRequest, "invalid request format (bad annotations dictionary)");
     return;
   }
   const lmo::Dictionary given = lmo::propertyListFromMessage(*annotations);
   // Only the two known keys travel on; anything else a client sends is
   // dropped here rather than stored.
   lmo::Dictionary change;
-  if (const lmo::Value* election = given.find(kElectionKey)) {
+  if (const lmo::Value* election = given.find(protocol::kAnnotationElection)) {
     if (!election->isNumeric()) {
-      failMessage(base::kErrorBadRequest, "invalid request format (annotation election)");
+      failMessage(protocol::kErrorBadRequest, "invalid request format (annotation election)");
       return;
     }
-    change = change.setting(kElectionKey, *election);
+    change = change.setting(protocol::kAnnotationElection, *election);
   }
-  if (const lmo::Value* extension = given.find(kExtensionKey)) {
+  if (const lmo::Value* extension = given.find(protocol::kAnnotationExtension)) {
     if (extension->getIfDictionary() == nullptr) {
-      failMessage(base::kErrorBadRequest, "invalid request format (annotation extension)");
+      failMessage(protocol::kErrorBadRequest, "invalid request format (annotation extension)");
       return;
     }
-    change = change.setting(kExtensionKey, *extension);
+    change = change.setting(protocol::kAnnotationExtension, *extension);
   }
   if (change.empty()) {
     done();
@@ -47,7 +41,9 @@ void Transaction::annotatePlugIns() {
   }
   const bool annotated = processUuidList([&](const registry::VTDPlugInPtr& plugIn) {
     base::vtlog("client %d plug-in %@ election := %@", client()->pid(), plugIn->identifier(),
-                change.find(kElectionKey) ? std::optional(change.get(kElectionKey)) : std::nullopt);
+                change.find(protocol::kAnnotationElection)
+                    ? std::optional(change.get(protocol::kAnnotationElection))
+                    : std::nullopt);
     server()->setAnnotation(change, *plugIn);
     return true;
   });

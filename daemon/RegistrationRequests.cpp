@@ -12,13 +12,13 @@ namespace vantrel::daemon {
 void Transaction::addPlugIns() {
   processPaths([this](const std::string& path, bool resolved) {
     if (!resolved) {
-      failMessage(base::kErrorBadPath, base::format("invalid plugin path: %@", path));
+      failMessage(protocol::kErrorBadPath, base::format("invalid plugin path: %@", path));
       return false;
     }
     probes::pluginAdd(path.c_str());
     if (server()->addPlugIn(model::FileUrl::fromPath(path))) {
       base::vtlog("failed to register plug-in at %@", path);
-      failMessage(base::kErrorRegistryRefused,
+      failMessage(protocol::kErrorRegistryRefused,
                   base::format("unable to register plug-in at %@", path));
       return false;
     }
@@ -32,7 +32,7 @@ void Transaction::removePlugIns() {
   processPaths([this](const std::string& path, bool resolved) {
     probes::pluginRemove(path.c_str(), resolved);
     if (server()->removePlugIn(model::FileUrl::fromPath(path))) {
-      failMessage(base::kErrorBadPath, base::format("no plugin at %@", path));
+      failMessage(protocol::kErrorBadPath, base::format("no plugin at %@", path));
       return false;
     }
     return true;
@@ -40,7 +40,7 @@ void Transaction::removePlugIns() {
 }
 
 void Transaction::bulkPlugIns() {
-  const uint64_t flags = request().get("flags").getIfUInt64().value_or(0);
+  const uint64_t flags = request().get(protocol::kKeyFlags).getIfUInt64().value_or(0);
   base::vtlog("bulk options 0x%lx not supported", static_cast<uint32_t>(flags));
   done();
 }

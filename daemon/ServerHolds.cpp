@@ -8,17 +8,17 @@
 
 namespace vantrel::daemon {
 
-bool VTDServer::holdOnPlugIn(const registry::VTDPlugIn& plugIn) {
-  bool held = false;
+VTDPlugInHoldPtr VTDServer::holdFor(const registry::VTDPlugIn& plugIn) {
+  VTDPlugInHoldPtr found;
   syncQueue_->sync([&] {
     for (const VTDPlugInHoldPtr& hold : holds_) {
       if (hold->blocks(plugIn)) {
-        held = true;
+        found = hold;
         break;
       }
     }
   });
-  return held;
+  return found;
 }
 
 void VTDServer::addHold(VTDPlugInHoldPtr hold) {

@@ -10,6 +10,7 @@
 #include "daemon/VTDLmoClient.h"
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
+#include "lmo/Protocol.h"
 #include "platform/Probes.h"
 
 namespace vantrel::daemon {
@@ -27,14 +28,19 @@ struct Operation {
 
 // Looked up in this order, byte for byte.
 constexpr Operation kDispatchTable[] = {
-    {"add", &Transaction::addPlugIns},           {"remove", &Transaction::removePlugIns},
-    {"bulk", &Transaction::bulkPlugIns},         {"match", &Transaction::matchPlugIns},
-    {"ready", &Transaction::readyPlugIns},       {"access", &Transaction::accessPlugIns},
-    {"annotate", &Transaction::annotatePlugIns}, {"lock", &Transaction::lockDownPlugIns},
+    {protocol::kRequestAdd, &Transaction::addPlugIns},
+    {protocol::kRequestRemove, &Transaction::removePlugIns},
+    {protocol::kRequestBulk, &Transaction::bulkPlugIns},
+    {protocol::kRequestMatch, &Transaction::matchPlugIns},
+    {protocol::kRequestReady, &Transaction::readyPlugIns},
+    {protocol::kRequestAccess, &Transaction::accessPlugIns},
+    {protocol::kRequestAnnotate, &Transaction::annotatePlugIns},
+    {protocol::kRequestLock, &Transaction::lockDownPlugIns},
+    {protocol::kRequestExplain, &Transaction::explainPlugIn},
 };
 
-// The canonical form of an absolute path, or nullopt when it does not exist,
-// cannot be resolved, holds a NUL byte or resolves to something too long.
+}  // namespace
+
 std::optional<std::string> canonicalPath(const std::string& path) {
   if (path.find('\0') != std::string::npos) return std::nullopt;
   std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr),
@@ -44,8 +50,6 @@ std::optional<std::string> canonicalPath(const std::string& path) {
   if (canonical.size() >= kMaxCanonicalPathBytes) return std::nullopt;
   return canonical;
 }
-
-}  // namespace
 
 TransactionPtr Transaction::initWithRequest(lmo::IncomingMessage request,
                                             std::shared_ptr<VTDLmoClient> client) {
@@ -68,13 +72,13 @@ std::shared_ptr<lmo::Connection> Transaction::connection() const {
 void Transaction::dispatch() {
   server()->mainQueue()->assertCurrent();
   const lmo::Dictionary& body = request();
-  const std::string* type = body.get("request").getIfString();
-  version_ = body.get("version").getIfUInt64().value_or(0);
-  if (version_ != kOldestProtocolVersion && version_ != kCurrentProtocolVersion) {
-    failMessage(base::kErrorVersionMismatch,
+  const std::string* type = body.get(protocol::kKeyRequest).getIfString();
+  version_ = body.get(protocol::kKeyVersion).getIfUInt64().value_or(0);
+  if (version_ != protocol::kOldestVersion && version_ != protocol::kCurrentVersion) {
+    failMessage(protocol::kErrorVersionMismatch,
                 base::format("unsupported protocol version %d (current %d)",
                              static_cast<int32_t>(static_cast<uint32_t>(version_)),
-                             kCurrentProtocolVersion));
+                             protocol::kCurrentVersion));
     return;
   }
   if (!client_->acceptWork()) return;
@@ -82,7 +86,7 @@ void Transaction::dispatch() {
   server()->debug("client %d request %s", client_->pid(), typeText);
   probes::request(client_->pid(), typeText ? typeText : "(null)");
   if (type == nullptr) {
-    failMessage(base::kErrorBadRequest, "invalid request format (missing type)");
+    failMessage(protocol::kErrorBadRequest, "invalid request format (missing type)");
     return;
   }
   for (const Operation& operation : kDispatchTable) {
@@ -91,7 +95,7 @@ void Transaction::dispatch() {
       return;
     }
   }
-  failMessage(base::kErrorBadRequest, "unrecognized request");
+  failMessage(protocol::kErrorBadRequest, "unrecognized request");
 }
 
 void Transaction::setReplyValue(std::string_view key, lmo::Value value) {
@@ -113,15 +117,17 @@ void Transaction::done() {
   server()->log("unable to send reply to pid %d: %@", client_->pid(), sent.error());
   lmo::Reply fallback{lmo::Dictionary{}, reply_->inReplyTo};
   fallback.body = fallback.body.setting(
-      "errorcode", lmo::Value::unsignedInteger(static_cast<uint64_t>(base::kErrorBadRequest)));
-  fallback.body = fallback.body.setting("error", lmo::Value(sent.error().description()));
+      protocol::kKeyErrorCode,
+      lmo::Value::unsignedInteger(static_cast<uint64_t>(protocol::kErrorBadRequest)));
+  fallback.body =
+      fallback.body.setting(protocol::kKeyError, lmo::Value(sent.error().description()));
   (void)peer->sendReply(fallback);
 }
 
 void Transaction::failMessage(int32_t code, std::string_view message) {
   const uint64_t wire = static_cast<uint64_t>(static_cast<int64_t>(code));
-  setReplyValue("errorcode", lmo::Value::unsignedInteger(wire));
-  setReplyValue("error", lmo::Value(message));
+  setReplyValue(protocol::kKeyErrorCode, lmo::Value::unsignedInteger(wire));
+  setReplyValue(protocol::kKeyError, lmo::Value(message));
   done();
 }
 
@@ -134,19 +140,21 @@ void Transaction::failError(int32_t code, const base::Error& error) {
 }
 
 bool Transaction::marshalPaths(const PathBlock& block) {
-  const std::optional<lmo::Array> paths = lmo::lmo_dictionary_get_array(request(), "paths");
+  const std::optional<lmo::Array> paths =
+      lmo::lmo_dictionary_get_array(request(), protocol::kKeyPaths);
   if (!paths) {
-    failMessage(base::kErrorBadRequest, "invalid request format");
+    failMessage(protocol::kErrorBadRequest, "invalid request format");
     return false;
   }
   for (const lmo::Value& element : *paths) {
     const std::string* path = element.getIfString();
     if (path == nullptr) {
-      failMessage(base::kErrorBadRequest, "invalid request format");
+      failMessage(protocol::kErrorBadRequest, "invalid request format");
       return false;
     }
     if (path->empty() || path->front() != '/') {
-      failMessage(base::kErrorBadPath, base::format("absolute path required: %s", path->c_str()));
+      failMessage(protocol::kErrorBadPath,
+                  base::format("absolute path required: %s", path->c_str()));
       return false;
     }
     const std::optional<std::string> canonical = canonicalPath(*path);
@@ -162,20 +170,21 @@ bool Transaction::processPaths(const PathBlock& block) {
 }
 
 bool Transaction::processUuidList(const PlugInBlock& block) {
-  const std::optional<lmo::Array> uuids = lmo::lmo_dictionary_get_array(request(), "uuids");
+  const std::optional<lmo::Array> uuids =
+      lmo::lmo_dictionary_get_array(request(), protocol::kKeyUuids);
   if (!uuids) {
-    failMessage(base::kErrorBadRequest, "invalid request format (uuid)");
+    failMessage(protocol::kErrorBadRequest, "invalid request format (uuid)");
     return false;
   }
   for (const lmo::Value& element : *uuids) {
     const base::Uuid* uuid = element.getIfUuid();
     if (uuid == nullptr) {
-      failMessage(base::kErrorBadRequest, "invalid request (bad uuid array)");
+      failMessage(protocol::kErrorBadRequest, "invalid request (bad uuid array)");
       return false;
     }
     registry::VTDPlugInPtr plugIn = server()->findPlugIn(*uuid);
     if (!plugIn) {
-      failMessage(base::kErrorBadRequest, "no such plugin (uuid not found)");
+      failMessage(protocol::kErrorBadRequest, "no such plugin (uuid not found)");
       return false;
     }
     if (!block(plugIn)) return false;

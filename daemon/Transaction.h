@@ -18,6 +18,7 @@
 #include "base/Error.h"
 #include "lmo/Connection.h"
 #include "lmo/Event.h"
+#include "lmo/Protocol.h"
 #include "lmo/Value.h"
 #include "registry/VTDPlugIn.h"
 
@@ -26,10 +27,12 @@ namespace vantrel::daemon {
 class VTDLmoClient;
 class VTDServer;
 struct MatchState;
+struct MatchHost;
+enum class FormDetail;
 
-// The protocol version this daemon speaks, and the oldest it still serves.
-inline constexpr uint64_t kCurrentProtocolVersion = 3;
-inline constexpr uint64_t kOldestProtocolVersion = 2;
+// The canonical form of an absolute path, or nullopt when it does not exist,
+// cannot be resolved, holds a NUL byte or resolves to something too long.
+std::optional<std::string> canonicalPath(const std::string& path);
 
 class Transaction : public std::enable_shared_from_this<Transaction> {
  public:
@@ -73,6 +76,7 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   void accessPlugIns();
   void annotatePlugIns();
   void lockDownPlugIns();
+  void explainPlugIn();
 
   // Sets the form's "annotations" to the plug-in's annotation (empty when
   // it has none).
@@ -90,11 +94,30 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   std::shared_ptr<lmo::Connection> connection() const;
 
  private:
-  // The match request's candidate steps.
+  // ---- Discovery, shared by "match" and "explain" ----
+
+  // Reads "rules" and "flags" (refusing an unauthorised kAll) and the
+  // user's exclusions. Replies itself and returns false on an error.
+  bool readMatchInput(std::optional<lmo::Dictionary>& rules, MatchState& state);
+  // Visits every candidate of the registry (those of one identifier only,
+  // when it is not empty) in the registry's order.
+  void runMatch(MatchState& state, const std::optional<lmo::Dictionary>& rules,
+                const MatchHost& host, FormDetail detail, std::string_view onlyIdentifier = {});
+  // Runs the filters on one candidate and, when it passes them all, adds
+  // its form to the results unless a duplicate beats it.
   void visitCandidate(const registry::VTDPlugIn& plugIn, MatchState& state,
-                      const std::optional<lmo::Dictionary>& rules);
-  bool keepCandidate(const registry::VTDPlugIn& plugIn, uint64_t flags,
-                     const lmo::Array& exclusions, const std::optional<lmo::Dictionary>& rules);
+                      const std::optional<lmo::Dictionary>& rules, const MatchHost& host,
+                      FormDetail detail);
+  bool keepCandidate(const registry::VTDPlugIn& plugIn, const MatchState& state,
+                     const std::optional<lmo::Dictionary>& rules, const MatchHost& host);
+
+  // ---- "explain" ----
+  // Adds every key of keys to the reply and sends it.
+  void replyWith(const lmo::Dictionary& keys);
+  lmo::Dictionary explainStatus();
+  lmo::Dictionary explainRecord(const omnidex::PlugInRecordPtr& record,
+                                const std::optional<lmo::Dictionary>& rules, MatchState& state,
+                                const MatchHost& host);
 
   Transaction(lmo::IncomingMessage request, std::shared_ptr<VTDLmoClient> client);
 

@@ -102,8 +102,7 @@ lmo::Value VTDLmoClient::entitlementValueForKey(std::string_view key) const {
 }
 
 bool VTDLmoClient::hasEntitlement(std::string_view key) const {
-  const lmo::Value value = entitlementValueForKey(key);
-  return !value.isNull() && !(value == lmo::Value::boolean(false));
+  return granted(entitlementValueForKey(key));
 }
 
 std::string VTDLmoClient::description() const {

@@ -96,7 +96,9 @@ class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelega
   // ---- Holds (each synchronous; never call them on syncQueue()) ----
 
   // Whether any active hold blocks the plug-in.
-  bool holdOnPlugIn(const registry::VTDPlugIn& plugIn);
+  bool holdOnPlugIn(const registry::VTDPlugIn& plugIn) { return holdFor(plugIn) != nullptr; }
+  // The oldest active hold that blocks the plug-in, or null.
+  VTDPlugInHoldPtr holdFor(const registry::VTDPlugIn& plugIn);
   // Adds a hold and announces the change.
   void addHold(VTDPlugInHoldPtr hold);
   // Releases the hold with that token, whoever asks; an unknown token

@@ -1,5 +1,7 @@
 #include "lmo/Message.h"
 
+#include "lmo/Protocol.h"
+
 namespace vantrel::lmo {
 
 std::optional<Array> lmo_dictionary_get_array(const Dictionary& message, const char* key) {
@@ -22,6 +24,13 @@ std::optional<Dictionary> messageFromPropertyList(const Value& object) {
 
 Dictionary propertyListFromMessage(const Dictionary& message) {
   return message;
+}
+
+std::optional<Value> convertToLMO(const Value& object, uint64_t version) {
+  if (version != protocol::kCurrentVersion) return std::nullopt;
+  // Messages and property lists share one value type: the conversion is the
+  // value itself, whatever its kind.
+  return object;
 }
 
 }  // namespace vantrel::lmo

@@ -23,5 +23,9 @@ std::optional<Dictionary> lmo_dictionary_get_dictionary(const Dictionary& messag
 std::optional<Dictionary> messageFromPropertyList(const Value& object);
 // A message dictionary as an ordinary property-list dictionary.
 Dictionary propertyListFromMessage(const Dictionary& message);
+// A property-list object as a message value for a peer speaking version
+// (a match reply's "matches" is an array of forms); nullopt unless version is
+// protocol::kCurrentVersion, whose peers are the only ones that read it.
+std::optional<Value> convertToLMO(const Value& object, uint64_t version);
 
 }  // namespace vantrel::lmo

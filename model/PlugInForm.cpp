@@ -3,6 +3,7 @@
 
 #include <limits>
 
+#include "lmo/Protocol.h"
 #include "model/Collections.h"
 #include "model/MetadataKeys.h"
 #include "model/VTPlugInCore.h"
@@ -14,24 +15,7 @@ using lmo::Value;
 
 namespace {
 
-constexpr std::string_view kFormHubProtocolVersion = "hubProtocolVersion";
-constexpr std::string_view kFormPath = "path";
-constexpr std::string_view kFormSystemResident = "systemResident";
-constexpr std::string_view kFormIdentifier = "identifier";
-constexpr std::string_view kFormOriginalIdentifier = "original-identifier";
-constexpr std::string_view kFormVersion = "version";
-constexpr std::string_view kFormBundleInfo = "bundleInfo";
-constexpr std::string_view kFormInfo = "info";
-constexpr std::string_view kFormUuid = "uuid";
-constexpr std::string_view kFormLastModified = "lastmodified";
-constexpr std::string_view kFormAnnotations = "annotations";
-constexpr std::string_view kFormEntitlements = "entitlements";
-constexpr std::string_view kFormContainingPath = "containingPath";
-constexpr std::string_view kFormContainingName = "localizedContainingDisplayName";
-constexpr std::string_view kFormDisplayName = "localizedDisplayName";
-constexpr std::string_view kFormShortName = "localizedShortName";
-constexpr std::string_view kFormHash = "hash";
-constexpr std::string_view kFormRequirement = "requirement";
+using namespace protocol;
 
 // A form's hub protocol version when it carries none (or not a number that
 // fits).

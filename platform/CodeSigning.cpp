@@ -1,5 +1,7 @@
 #include "platform/CodeSigning.h"
 
+#include <sys/stat.h>
+
 #include <utility>
 
 #include "base/Format.h"
@@ -61,10 +63,23 @@ base::Result<CodeSigningTaskPtr> CodeSigningTask::create(pid_t pid, int pidfd) {
   return CodeSigningTaskPtr(std::move(task));
 }
 
+base::Result<CodeSigningTaskPtr> CodeSigningTask::createForBundle(const std::string& bundlePath) {
+  struct stat st {};
+  if (::stat(bundlePath.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+    return noExecutable(base::format("no bundle at %@", bundlePath));
+  }
+  std::shared_ptr<CodeSigningTask> task(new CodeSigningTask(0, bundlePath));
+  task->bundlePath_ = bundlePath;
+  task->readEntitlements();
+  return CodeSigningTaskPtr(std::move(task));
+}
+
 void CodeSigningTask::readEntitlements() {
-  if (std::shared_ptr<BundleObject> bundle =
-          BundleObject::create(executablePath_, BundleObject::Kind::kExecutable)) {
-    bundlePath_ = bundle->stringProperty(kBundlePathProperty);
+  if (!bundlePath_) {
+    if (std::shared_ptr<BundleObject> bundle =
+            BundleObject::create(executablePath_, BundleObject::Kind::kExecutable)) {
+      bundlePath_ = bundle->stringProperty(kBundlePathProperty);
+    }
   }
   entitlementsPath_ = bundlePath_ ? childPath(*bundlePath_, kBundleEntitlementsFileName)
                                   : executablePath_ + kExecutableEntitlementsSuffix;

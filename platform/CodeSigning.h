@@ -67,10 +67,16 @@ class CodeSigningTask {
   // handle then holds no entitlements and reports entitlementsError().
   // No entitlements file at all is not an error: the entitlements are empty.
   static base::Result<CodeSigningTaskPtr> create(pid_t pid, int pidfd);
+  // The identity an application bundle's code would have when run: its
+  // Entitlements.plist under the same trust rule, pid 0. Errors: domain
+  // "CodeSigning", kCodeSigningNoExecutable when path is not a directory.
+  static base::Result<CodeSigningTaskPtr> createForBundle(const std::string& bundlePath);
 
   pid_t pid() const { return pid_; }
   const std::string& executablePath() const { return executablePath_; }
-  // The bundle directory of the executable; nullopt when it has none.
+  // The bundle directory of the executable; nullopt when it has none. The
+  // bundle itself for a task made by createForBundle (whose executablePath
+  // is the bundle's path too).
   const std::optional<std::string>& bundlePath() const { return bundlePath_; }
   // The file the entitlements were (or would have been) read from.
   const std::string& entitlementsPath() const { return entitlementsPath_; }

@@ -18,6 +18,12 @@ class VTDHost {
   virtual lmo::Value entitlementValueForKey(std::string_view key) const = 0;
   // The entitlement exists and is not false.
   virtual bool hasEntitlement(std::string_view key) const = 0;
+
+  // What hasEntitlement answers for an entitlement's value: it exists and
+  // is not false.
+  static bool granted(const lmo::Value& value) {
+    return !value.isNull() && !(value == lmo::Value::boolean(false));
+  }
 };
 
 }  // namespace vantrel::registry

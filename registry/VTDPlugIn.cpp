@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "model/MetadataKeys.h"
 #include "platform/Paths.h"
 
@@ -38,6 +39,25 @@ base::Error invalid(const char* message) {
 }  // namespace
 
 std::shared_ptr<VTDPlugIn> VTDPlugIn::initWithOXData(omnidex::PlugInRecordPtr record) {
+  std::shared_ptr<VTDPlugIn> plugIn = fromOXData(record);
+  if (!plugIn) return nullptr;
+  if (std::optional<base::Error> error = plugIn->diagnose()) {
+    base::vtlog("ignoring mis-configured plug-in at %@: %@", *record->bundlePath,
+                error->description());
+    return nullptr;
+  }
+  return plugIn;
+}
+
+std::optional<base::Error> VTDPlugIn::recordProblem(const omnidex::PlugInRecordPtr& record) {
+  const std::shared_ptr<VTDPlugIn> plugIn = fromOXData(record);
+  if (!plugIn) {
+    return base::error_with_code(protocol::kErrorInvalidPlugIn, "missing identifier or bundle");
+  }
+  return plugIn->diagnose();
+}
+
+std::shared_ptr<VTDPlugIn> VTDPlugIn::fromOXData(const omnidex::PlugInRecordPtr& record) {
   if (!record || !record->bundlePath) return nullptr;
   auto plugIn = VTPlugInCore::initWithName<VTDPlugIn>(
       record->identifier, model::FileUrl::fromPath(*record->bundlePath), Value(),
@@ -65,11 +85,6 @@ std::shared_ptr<VTDPlugIn> VTDPlugIn::initWithOXData(omnidex::PlugInRecordPtr re
     plugIn->setContainingUrl(model::FileUrl::fromPath(record->containingApplication->bundlePath));
   }
 
-  if (std::optional<base::Error> error = plugIn->diagnose()) {
-    base::vtlog("ignoring mis-configured plug-in at %@: %@", *record->bundlePath,
-                error->description());
-    return nullptr;
-  }
   return plugIn;
 }
 

@@ -48,6 +48,10 @@ class VTDPlugIn : public model::VTPlugInCore {
   // with the bundle path and the reason. Runs on the database queue; the
   // record is complete before anyone else sees it.
   static std::shared_ptr<VTDPlugIn> initWithOXData(omnidex::PlugInRecordPtr record);
+  // Why initWithOXData makes no record of this registry record: the
+  // validation error of a mis-configured plug-in, or code 12 "missing
+  // identifier or bundle"; nullopt when it makes one. Logs nothing.
+  static std::optional<base::Error> recordProblem(const omnidex::PlugInRecordPtr& record);
 
   // ---- Metadata, through the registry record ----
   // A record that has no registry record (one made from a form) answers from
@@ -172,6 +176,10 @@ class VTDPlugIn : public model::VTPlugInCore {
   void setOxproxy(omnidex::PlugInRecordPtr record) { oxproxy_ = std::move(record); }
 
  private:
+  // The record of a registry record before validation; null without a
+  // bundle path or identifier.
+  static std::shared_ptr<VTDPlugIn> fromOXData(const omnidex::PlugInRecordPtr& record);
+
   using NameFetch = std::optional<std::string> (*)(const omnidex::PlugInRecord&);
   // The stored name in field, or (when none is stored) the registry's,
   // which is stored unless a setter got there first.
