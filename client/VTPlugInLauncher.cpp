@@ -21,7 +21,7 @@
 #include "platform/Paths.h"
 #include "platform/PropertyList.h"
 #include "platform/ScopedFd.h"
-#include "platform/ServiceManager.h"
+#include "platform/LaunchDescription.h"
 #include "platform/TrustedFile.h"
 
 namespace vantrel::client {

@@ -3,7 +3,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <poll.h>
-#include <sys/eventfd.h>
+#include <sys/epoll.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -13,12 +13,14 @@
 #include <charconv>
 #include <climits>
 #include <cstring>
+#include <future>
+#include <map>
 #include <mutex>
 #include <set>
-#include <thread>
 #include <utility>
 
 #include "base/Log.h"
+#include "lmo/IoLoop.h"
 #include "platform/AtomicFile.h"
 #include "platform/Paths.h"
 #include "platform/ProcessInfo.h"
@@ -30,8 +32,6 @@ namespace {
 
 constexpr const char* kQueueLabel = "com.karvo.vantrel.servicemanager";
 constexpr const char* kFileName = "services.plist";
-constexpr const char* kServicesDirectoryName = "services";
-constexpr const char* kLaunchFileSuffix = ".plist";
 constexpr mode_t kDirectoryMode = 0755;
 // The table names every host and its plug-ins' environments; a host reads
 // only its own launch descriptions.
@@ -41,26 +41,8 @@ constexpr mode_t kServicesDirectoryMode = 0711;
 constexpr mode_t kHostDirectoryMode = 0700;
 constexpr mode_t kLaunchFileMode = 0600;
 
-constexpr const char* kFormatVersionKey = "formatVersion";
-constexpr const char* kServicesKey = "services";
-constexpr const char* kBundleIdentifierKey = "bundleIdentifier";
-constexpr const char* kVersionKey = "version";
-constexpr const char* kPidKey = "pid";
-constexpr const char* kExecutableKey = "executable";
-constexpr const char* kDescriptionKey = "description";
-
 constexpr std::string_view kUidField = "Uid:";
 constexpr std::string_view kGidField = "Gid:";
-
-bool isSameService(const ExternalServiceRegistration& a, const ExternalServiceRegistration& b) {
-  return a.bundleIdentifier == b.bundleIdentifier && a.version == b.version &&
-         a.hostPid == b.hostPid;
-}
-
-bool isValid(const ExternalServiceRegistration& r) {
-  return isSinglePathComponent(r.bundleIdentifier, kMaxPublishedBundleIdentifierLength) &&
-         r.hostPid > 0 && !r.executablePath.empty() && r.executablePath.front() == '/';
-}
 
 std::string pidText(pid_t pid) {
   return base::format("%d", static_cast<int>(pid));
@@ -130,182 +112,7 @@ int errorNumber(const base::Error& error) {
              : EIO;
 }
 
-// ---- The table file ----
-
-lmo::Value encode(const std::vector<ExternalServiceRegistration>& table) {
-  std::vector<lmo::Value> services;
-  services.reserve(table.size());
-  for (const ExternalServiceRegistration& r : table) {
-    services.emplace_back(lmo::Dictionary{
-        {kBundleIdentifierKey, r.bundleIdentifier},
-        {kVersionKey, r.version},
-        {kPidKey, lmo::Value::integer(r.hostPid)},
-        {kExecutableKey, r.executablePath},
-        {kDescriptionKey, r.description},
-    });
-  }
-  return lmo::Dictionary{
-      {kFormatVersionKey, lmo::Value::integer(kServicesFileFormatVersion)},
-      {kServicesKey, lmo::Array(std::move(services))},
-  };
-}
-
-std::optional<ExternalServiceRegistration> decodeEntry(const lmo::Value& entry) {
-  const lmo::Dictionary* d = entry.getIfDictionary();
-  if (d == nullptr) return std::nullopt;
-  const std::string* bundleIdentifier = d->get(kBundleIdentifierKey).getIfString();
-  const std::string* version = d->get(kVersionKey).getIfString();
-  const std::optional<int64_t> pid = d->get(kPidKey).getIfInt64();
-  const std::string* executable = d->get(kExecutableKey).getIfString();
-  const lmo::Dictionary* description = d->get(kDescriptionKey).getIfDictionary();
-  if (!bundleIdentifier || !version || !pid || !executable || !description) return std::nullopt;
-  if (*pid <= 0 || *pid > INT_MAX) return std::nullopt;
-  ExternalServiceRegistration r{*bundleIdentifier, *version, static_cast<pid_t>(*pid), *executable,
-                                *description};
-  if (!isValid(r)) return std::nullopt;
-  return r;
-}
-
-base::Error malformed(const char* what) {
-  return base::Error{kPropertyListErrorDomain, kPropertyListMalformed, what};
-}
-
-// The table a file holds, or a description of what is wrong with it.
-base::Result<std::vector<ExternalServiceRegistration>> decode(const lmo::Value& file) {
-  const lmo::Dictionary* top = file.getIfDictionary();
-  if (top == nullptr) return malformed("not a dictionary");
-  if (top->get(kFormatVersionKey).getIfInt64() != kServicesFileFormatVersion) {
-    return malformed("unknown format version");
-  }
-  const lmo::Array* services = top->get(kServicesKey).getIfArray();
-  if (services == nullptr) return malformed("no services array");
-  if (services->size() > kMaxExternalServiceRegistrations) return malformed("too many services");
-  std::vector<ExternalServiceRegistration> table;
-  table.reserve(services->size());
-  for (const lmo::Value& entry : *services) {
-    std::optional<ExternalServiceRegistration> r = decodeEntry(entry);
-    if (!r) return malformed("malformed service entry");
-    table.push_back(std::move(*r));
-  }
-  return table;
-}
-
-// ---- Launch descriptions ----
-
-// What is wrong with an "LMOService" dictionary; nullptr when nothing.
-const char* serviceProblem(const lmo::Dictionary& service) {
-  const lmo::Value& environment = service.get(kLaunchEnvironmentKey);
-  if (!environment.isNull()) {
-    const lmo::Dictionary* variables = environment.getIfDictionary();
-    if (variables == nullptr) return "the environment is not a dictionary";
-    if (variables->size() > kMaxLaunchEnvironmentVariables) return "too many environment variables";
-  }
-  const lmo::Value& profile = service.get(kLaunchSandboxProfileKey);
-  if (!profile.isNull() && profile.getIfString() == nullptr) {
-    return "the sandbox profile is not a string";
-  }
-  return nullptr;
-}
-
-const lmo::Dictionary& environmentOf(const lmo::Dictionary& service) {
-  static const lmo::Dictionary kNone;
-  const lmo::Dictionary* variables = service.get(kLaunchEnvironmentKey).getIfDictionary();
-  return variables != nullptr ? *variables : kNone;
-}
-
-bool isAbsolutePath(const std::string* path) {
-  return path != nullptr && !path->empty() && path->front() == '/';
-}
-
-bool isEnvironmentName(std::string_view name) {
-  return !name.empty() && name.find('=') == std::string_view::npos;
-}
-
 }  // namespace
-
-std::optional<base::Error> executableProblem(const std::string& path) {
-  struct stat st;
-  if (::stat(path.c_str(), &st) != 0) return posixError(errno, "no executable at", path);
-  if (!S_ISREG(st.st_mode) || (st.st_mode & (S_IXUSR | S_IXGRP | S_IXOTH)) == 0) {
-    return posixError(EACCES, "cannot execute", path);
-  }
-  return std::nullopt;
-}
-
-std::string launchDirectoryPath(const std::string& directory, pid_t pid) {
-  return base::format("%@/%s/%d", directory, kServicesDirectoryName, static_cast<int>(pid));
-}
-
-std::string launchDescriptionPath(const std::string& directory, pid_t pid,
-                                  std::string_view bundleIdentifier) {
-  return base::format("%@/%@%s", launchDirectoryPath(directory, pid), bundleIdentifier,
-                      kLaunchFileSuffix);
-}
-
-base::Result<lmo::Value> encodeLaunchDescription(const ExternalServiceRegistration& registration) {
-  const auto invalid = [&](int code, const char* what) {
-    return base::Error{kPosixErrorDomain, code,
-                       base::format("malformed launch description for %@: %s",
-                                    registration.bundleIdentifier, what)};
-  };
-  lmo::Dictionary service;
-  if (const lmo::Value& value = registration.description.get(kLaunchServiceKey); !value.isNull()) {
-    const lmo::Dictionary* dictionary = value.getIfDictionary();
-    if (dictionary == nullptr) return invalid(EINVAL, "the service is not a dictionary");
-    service = *dictionary;
-  }
-  if (const char* problem = serviceProblem(service)) {
-    return invalid(environmentOf(service).size() > kMaxLaunchEnvironmentVariables ? E2BIG : EINVAL,
-                   problem);
-  }
-  lmo::Dictionary file{
-      {kLaunchFormatVersionKey, lmo::Value::integer(kLaunchDescriptionFormatVersion)},
-      {kLaunchBundleIdentifierKey, registration.bundleIdentifier},
-      {kLaunchVersionKey, registration.version},
-      {kLaunchExecutableKey, registration.executablePath},
-      {kLaunchHostPidKey, lmo::Value::integer(registration.hostPid)},
-      {kLaunchServiceKey, service},
-  };
-  const std::string* container =
-      registration.dataContainer ? &*registration.dataContainer : nullptr;
-  if (isAbsolutePath(container)) file = file.setting(kLaunchWorkingDirectoryKey, *container);
-  return lmo::Value(file);
-}
-
-base::Result<LaunchDescription> decodeLaunchDescription(const lmo::Value& file) {
-  const lmo::Dictionary* top = file.getIfDictionary();
-  if (top == nullptr) return malformed("not a dictionary");
-  if (top->get(kLaunchFormatVersionKey).getIfInt64() != kLaunchDescriptionFormatVersion) {
-    return malformed("unknown format version");
-  }
-  const std::string* bundleIdentifier = top->get(kLaunchBundleIdentifierKey).getIfString();
-  const std::string* version = top->get(kLaunchVersionKey).getIfString();
-  const std::string* executable = top->get(kLaunchExecutableKey).getIfString();
-  const std::optional<int64_t> pid = top->get(kLaunchHostPidKey).getIfInt64();
-  const lmo::Dictionary* service = top->get(kLaunchServiceKey).getIfDictionary();
-  if (!bundleIdentifier || !version || !pid || !service) return malformed("a key is missing");
-  if (!isAbsolutePath(executable)) return malformed("the executable is not an absolute path");
-  if (*pid <= 0 || *pid > INT_MAX) return malformed("the host pid is out of range");
-  if (const char* problem = serviceProblem(*service)) return malformed(problem);
-  LaunchDescription d;
-  d.bundleIdentifier = *bundleIdentifier;
-  d.version = *version;
-  d.hostPid = static_cast<pid_t>(*pid);
-  d.executablePath = *executable;
-  for (const auto& [name, value] : environmentOf(*service)) {
-    const std::string* text = value.getIfString();
-    if (text != nullptr && isEnvironmentName(name)) d.environment.push_back(name + "=" + *text);
-  }
-  const std::string* profile = service->get(kLaunchSandboxProfileKey).getIfString();
-  d.sandboxProfile = profile != nullptr ? *profile : kDefaultSandboxProfile;
-  if (const lmo::Value& cwd = top->get(kLaunchWorkingDirectoryKey); !cwd.isNull()) {
-    if (!isAbsolutePath(cwd.getIfString())) {
-      return malformed("the working directory is not an absolute path");
-    }
-    d.workingDirectory = *cwd.getIfString();
-  }
-  return d;
-}
 
 // ---- Hosts and their watcher ----
 
@@ -346,103 +153,80 @@ base::Result<ServiceManager::HostPtr> ServiceManager::Host::open(pid_t pid, int 
   return HostPtr(std::move(host));
 }
 
-// Polls every watched host's pidfd on a thread of its own and reports each
-// exit once. The hosts are shared with the service manager's queue; the
-// thread holds its own references while it polls, so a descriptor is never
-// closed under poll(2).
+// Watches every host's pidfd on the process's I/O loop (a pidfd becomes
+// readable when its process exits) and reports each exit once. Each watched
+// host is an I/O source holding its own reference, so a pidfd is never
+// closed while epoll still watches it.
 class ServiceManager::HostWatcher {
  public:
   using ExitHandler = std::function<void(HostPtr)>;
 
-  explicit HostWatcher(ExitHandler onExit)
-      : onExit_(std::move(onExit)), wakeFd_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
-    if (wakeFd_ < 0) {
-      base::writeLog(base::LogLevel::kError,
-                     base::format("cannot watch host processes: %s", std::strerror(errno)));
-      return;
-    }
-    thread_ = std::thread([this] { run(); });
-  }
-  ~HostWatcher() {
-    stop();
-    if (wakeFd_ >= 0) ::close(wakeFd_);
-  }
+  explicit HostWatcher(ExitHandler onExit) : onExit_(std::move(onExit)) {}
+  ~HostWatcher() { stop(); }
   HostWatcher(const HostWatcher&) = delete;
   HostWatcher& operator=(const HostWatcher&) = delete;
 
   void watch(HostPtr host) {
-    {
-      std::lock_guard lock(mutex_);
-      watched_.push_back(std::move(host));
-    }
-    wake();
+    onLoop([this, host = std::move(host)] {
+      if (stopping_ || sources_.contains(host.get())) return;
+      auto source = std::make_shared<Source>(this, host);
+      source->token = lmo::IoLoop::shared().add(host->pidfd, EPOLLIN, source);
+      sources_.emplace(host.get(), std::move(source));
+    });
   }
 
   void unwatch(const HostPtr& host) {
-    {
-      std::lock_guard lock(mutex_);
-      std::erase(watched_, host);
-    }
-    wake();
+    onLoop([this, host] { forget(host.get()); });
   }
 
-  // Joins the thread; no exit is reported afterwards.
+  // Stops watching every host; no exit is reported afterwards.
   void stop() {
-    {
-      std::lock_guard lock(mutex_);
+    onLoop([this] {
       stopping_ = true;
-    }
-    wake();
-    if (thread_.joinable()) thread_.join();
+      while (!sources_.empty()) forget(sources_.begin()->first);
+    });
   }
 
  private:
-  void wake() {
-    const uint64_t one = 1;
-    if (wakeFd_ >= 0) (void)!::write(wakeFd_, &one, sizeof one);
+  struct Source : lmo::IoSource {
+    Source(HostWatcher* w, HostPtr h) : watcher(w), host(std::move(h)) {}
+    void handleIo(uint32_t) override { watcher->exited(host); }
+    HostWatcher* const watcher;  // outlives every source: stop() removes them first
+    const HostPtr host;
+    uint64_t token = 0;
+  };
+
+  // Runs task on the I/O thread and waits for it, so that callers see the
+  // watch set as they left it.
+  static void onLoop(const std::function<void()>& task) {
+    lmo::IoLoop& loop = lmo::IoLoop::shared();
+    if (loop.isCurrent()) return task();
+    std::promise<void> ran;
+    loop.post([&] {
+      task();
+      ran.set_value();
+    });
+    ran.get_future().wait();
   }
 
-  void run() {
-    std::vector<HostPtr> snapshot;
-    std::vector<pollfd> fds;
-    for (;;) {
-      {
-        std::lock_guard lock(mutex_);
-        if (stopping_) return;
-        snapshot = watched_;
-      }
-      fds.assign(1, pollfd{wakeFd_, POLLIN, 0});
-      for (const HostPtr& host : snapshot) fds.push_back(pollfd{host->pidfd, POLLIN, 0});
-      if (::poll(fds.data(), fds.size(), -1) < 0) {
-        if (errno == EINTR) continue;
-        base::writeLog(base::LogLevel::kError,
-                       base::format("cannot poll host processes: %s", std::strerror(errno)));
-        // Waits for the next change instead of spinning on the same error.
-        fds.resize(1);
-        (void)::poll(fds.data(), 1, -1);
-      }
-      uint64_t count = 0;
-      if (fds[0].revents != 0) (void)!::read(wakeFd_, &count, sizeof count);
-      for (size_t i = 1; i < fds.size(); ++i) {
-        if (fds[i].revents == 0) continue;
-        const HostPtr& exited = snapshot[i - 1];
-        {
-          std::lock_guard lock(mutex_);
-          std::erase(watched_, exited);
-        }
-        onExit_(exited);
-      }
-    }
+  // On the I/O thread.
+  void forget(const Host* host) {
+    auto it = sources_.find(host);
+    if (it == sources_.end()) return;
+    lmo::IoLoop::shared().remove(it->second->host->pidfd, it->second->token);
+    sources_.erase(it);
+  }
+  void exited(const HostPtr& host) {
+    if (!sources_.contains(host.get())) return;
+    forget(host.get());
+    onExit_(host);
   }
 
   // Constant after construction.
   const ExitHandler onExit_;
-  const int wakeFd_;  // -1 when no eventfd could be made: nothing is watched then
-
-  std::mutex mutex_;
-  std::vector<HostPtr> watched_;  // Guarded by mutex_.
-  bool stopping_ = false;         // Guarded by mutex_.
-  std::thread thread_;            // Started by the constructor, joined by stop().
+  // Owned by the I/O thread.
+  std::map<const Host*, std::shared_ptr<Source>> sources_;
+  bool stopping_ = false;
 };
 
 // ---- The manager ----
@@ -528,7 +312,7 @@ void ServiceManager::load() {
     return;  // nothing registered yet
   }
   base::Result<Table> loaded =
-      file.has_value() ? decode(file.value()) : base::Result<Table>(file.error());
+      file.has_value() ? decodeServiceTable(file.value()) : base::Result<Table>(file.error());
   if (!loaded.has_value()) {
     base::writeLog(base::LogLevel::kWarning,
                    base::format("ignoring the external services in %@: %@", path_,
@@ -578,12 +362,12 @@ void ServiceManager::adoptLoadedHosts(Table& loaded) {
 
 base::Result<void> ServiceManager::persist(const Table& table) {
   VT_TRY(ensureDirectory(directory_, kDirectoryMode));
-  return writePropertyListFile(path_, encode(table), kFileMode);
+  return writePropertyListFile(path_, encodeServiceTable(table), kFileMode);
 }
 
 base::Result<void> ServiceManager::createHostDirectory(const Host& host) {
   VT_TRY(ensureDirectory(directory_, kDirectoryMode));
-  VT_TRY(ensureDirectory(directory_ + "/" + kServicesDirectoryName, kServicesDirectoryMode));
+  VT_TRY(ensureDirectory(servicesDirectoryPath(directory_), kServicesDirectoryMode));
   const std::string dir = launchDirectoryPath(directory_, host.pid);
   if (::mkdir(dir.c_str(), kHostDirectoryMode) != 0 && errno != EEXIST) {
     return posixError(errno, "cannot create directory", dir);
@@ -645,7 +429,7 @@ void ServiceManager::dropHost(pid_t pid) {
 
 base::Result<void> ServiceManager::registerExternalService(ExternalServiceRegistration registration,
                                                            int hostPidfd) {
-  if (!isValid(registration)) {
+  if (!isValidRegistration(registration)) {
     return base::Error{kPosixErrorDomain, EINVAL,
                        base::format("invalid external service for %@ (pid %d, executable %@)",
                                     registration.bundleIdentifier, registration.hostPid,
