@@ -38,6 +38,7 @@ void Transaction::lockDownPlugIns() {
     done();
     return;
   }
+  if (!allowStateChange(protocol::kRequestLock)) return;
   // Compared whole: a value with any other bit set is refused.
   const auto flags = static_cast<protocol::HoldFlags>(
       request().get(protocol::kKeyFlags).getIfUInt64().value_or(0));

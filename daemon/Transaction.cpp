@@ -1,5 +1,7 @@
 #include "daemon/Transaction.h"
 
+#include <unistd.h>
+
 #include <climits>
 #include <cstdlib>
 #include <memory>
@@ -21,22 +23,27 @@ namespace {
 // buffer of that size would.
 constexpr size_t kMaxCanonicalPathBytes = 1024;
 
+// Whether a request changes the state the daemon keeps for its user.
+enum class Scope { kAnyPeer, kChangesState };
+
 struct Operation {
   std::string_view type;
   void (Transaction::*run)();
+  Scope scope;
 };
 
-// Looked up in this order, byte for byte.
+// Looked up in this order, byte for byte. "lock" decides for itself: taking
+// a hold changes state, presenting a token does not.
 constexpr Operation kDispatchTable[] = {
-    {protocol::kRequestAdd, &Transaction::addPlugIns},
-    {protocol::kRequestRemove, &Transaction::removePlugIns},
-    {protocol::kRequestBulk, &Transaction::bulkPlugIns},
-    {protocol::kRequestMatch, &Transaction::matchPlugIns},
-    {protocol::kRequestReady, &Transaction::readyPlugIns},
-    {protocol::kRequestAccess, &Transaction::accessPlugIns},
-    {protocol::kRequestAnnotate, &Transaction::annotatePlugIns},
-    {protocol::kRequestLock, &Transaction::lockDownPlugIns},
-    {protocol::kRequestExplain, &Transaction::explainPlugIn},
+    {protocol::kRequestAdd, &Transaction::addPlugIns, Scope::kChangesState},
+    {protocol::kRequestRemove, &Transaction::removePlugIns, Scope::kChangesState},
+    {protocol::kRequestBulk, &Transaction::bulkPlugIns, Scope::kAnyPeer},
+    {protocol::kRequestMatch, &Transaction::matchPlugIns, Scope::kAnyPeer},
+    {protocol::kRequestReady, &Transaction::readyPlugIns, Scope::kAnyPeer},
+    {protocol::kRequestAccess, &Transaction::accessPlugIns, Scope::kAnyPeer},
+    {protocol::kRequestAnnotate, &Transaction::annotatePlugIns, Scope::kChangesState},
+    {protocol::kRequestLock, &Transaction::lockDownPlugIns, Scope::kAnyPeer},
+    {protocol::kRequestExplain, &Transaction::explainPlugIn, Scope::kAnyPeer},
 };
 
 }  // namespace
@@ -91,11 +98,22 @@ void Transaction::dispatch() {
   }
   for (const Operation& operation : kDispatchTable) {
     if (operation.type == *type) {
+      if (operation.scope == Scope::kChangesState && !allowStateChange(*type)) return;
       (this->*operation.run)();
       return;
     }
   }
   failMessage(protocol::kErrorBadRequest, "unrecognized request");
+}
+
+bool Transaction::allowStateChange(std::string_view type) {
+  if (client_->mayChangeState()) return true;
+  failMessage(protocol::kErrorAccessDenied,
+              base::format("request \"%@\" refused: it changes what this daemon keeps for uid "
+                           "%u, and uid %u is not that user, root or a manager",
+                           type, static_cast<unsigned>(::geteuid()),
+                           static_cast<unsigned>(client_->uid())));
+  return false;
 }
 
 void Transaction::setReplyValue(std::string_view key, lmo::Value value) {

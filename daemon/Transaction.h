@@ -82,6 +82,10 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   // it has none).
   void addAnnotationForPlugIn(const registry::VTDPlugIn& plugIn, lmo::Dictionary& in);
 
+  // Whether the client may make a request of this type that changes the
+  // daemon's state; replies code 11 itself when it may not.
+  bool allowStateChange(std::string_view type);
+
   // ---- Accessors ----
   const std::shared_ptr<VTDLmoClient>& client() const { return client_; }
   const lmo::Dictionary& request() const { return request_.body(); }

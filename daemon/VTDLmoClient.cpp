@@ -1,8 +1,11 @@
 #include "daemon/VTDLmoClient.h"
 
+#include <unistd.h>
+
 #include "base/Format.h"
 #include "daemon/Transaction.h"
 #include "daemon/VTDServer.h"
+#include "lmo/Protocol.h"
 #include "model/FileUrl.h"
 #include "platform/Probes.h"
 #include "platform/ProcessInfo.h"
@@ -25,6 +28,7 @@ VTDLmoClient::~VTDLmoClient() = default;
 
 void VTDLmoClient::identifyPeer(const lmo::Connection& connection) {
   pid_ = connection.pid();
+  uid_ = connection.uid();
   const std::optional<std::string> executable = platform::processExecutablePath(pid_);
   if (executable) {
     bundle_ = model::VTBundle::initWithExecutableURL(model::FileUrl::fromPath(*executable));
@@ -103,6 +107,11 @@ lmo::Value VTDLmoClient::entitlementValueForKey(std::string_view key) const {
 
 bool VTDLmoClient::hasEntitlement(std::string_view key) const {
   return granted(entitlementValueForKey(key));
+}
+
+bool VTDLmoClient::mayChangeState() const {
+  if (uid_ == 0 || uid_ == ::geteuid()) return true;
+  return hasEntitlement(protocol::kManagerEntitlement);
 }
 
 std::string VTDLmoClient::description() const {

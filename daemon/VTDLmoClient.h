@@ -46,6 +46,12 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   // The peer's process id as the kernel gave it at connection time; kept
   // after the connection is gone.
   pid_t pid() const override { return pid_; }
+  // The peer's effective uid at connection time; (uid_t)-1 when unknown.
+  uid_t uid() const { return uid_; }
+  // Whether the peer may change the daemon's state (elections, registered
+  // bundles, holds): the daemon serves one user's choices, so only that
+  // user, root and holders of the manager entitlement may.
+  bool mayChangeState() const;
 
   // The value of one entitlement of the peer, or null. When the peer's
   // entitlements could not be read, "error retrieving entitlements for pid
@@ -92,6 +98,7 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   std::weak_ptr<lmo::Connection> connection_;
   std::shared_ptr<VTDServer> server_;
   pid_t pid_ = -1;
+  uid_t uid_ = static_cast<uid_t>(-1);
   std::shared_ptr<model::VTBundle> bundle_;
   platform::CodeSigningTaskPtr task_;
   std::optional<base::Error> taskError_;  // why task_ is null

@@ -1,0 +1,64 @@
+// Whose daemon it is: a peer of another user may discover and use plug-ins
+// but not change what the daemon keeps for its own user.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include "lmo/Protocol.h"
+#include "tests/daemon/DiscoveryFixture.h"
+
+namespace vantrel::daemon::testing {
+namespace {
+
+namespace protocol = vantrel::protocol;
+
+constexpr const char* kOtherUid = "65534";
+
+class Scope : public Discovery {
+ protected:
+  // The answer line of a test peer in mode (with args) as another user.
+  std::string askAsOtherUser(const std::string& peer, const char* mode,
+                             const std::vector<std::string>& args) {
+    std::vector<std::string> argv{std::string("--reuid=") + kOtherUid,
+                                  std::string("--regid=") + kOtherUid,
+                                  "--clear-groups",
+                                  peer,
+                                  mode,
+                                  socket_};
+    argv.insert(argv.end(), args.begin(), args.end());
+    auto process = vantrel::testing::PeerProcess::start("/usr/bin/setpriv", argv);
+    EXPECT_NE(process, nullptr);
+    return process ? process->readLine().value_or("(nothing)") : "(not started)";
+  }
+};
+
+TEST_F(Scope, AnotherUserMayDiscoverButNotChangeState) {
+  // The other user must reach the socket and run the peer.
+  for (std::string dir = tmp_.file("Tools/x"); dir.size() > 1;
+       dir = dir.substr(0, dir.rfind('/'))) {
+    if (dir.starts_with("/tmp/") || dir.starts_with(tmp_.file(""))) ::chmod(dir.c_str(), 0755);
+  }
+  const std::string peer = peerWith("Other", {{"unrelated", lmo::Value::boolean(true)}});
+  const std::string refusedTail = "\" refused: it changes what this daemon keeps for uid " +
+                                  std::to_string(::geteuid()) + ", and uid " + kOtherUid +
+                                  " is not that user, root or a manager";
+  const std::pair<const char*, std::string> cases[] = {
+      {protocol::kRequestMatch, "ok 2"},
+      {protocol::kRequestExplain, "ok"},
+      {protocol::kRequestAdd, std::string("error 11 request \"add") + refusedTail},
+      {protocol::kRequestRemove, std::string("error 11 request \"remove") + refusedTail},
+      {protocol::kRequestAnnotate, std::string("error 11 request \"annotate") + refusedTail},
+  };
+  for (const auto& [type, expected] : cases) {
+    const std::string answer = askAsOtherUser(peer, "request", {type, "0"});
+    EXPECT_TRUE(answer.starts_with(expected)) << type << ": " << answer;
+  }
+  const std::string hold = askAsOtherUser(
+      peer, "hold",
+      {std::to_string(protocol::bits(protocol::HoldFlags::kPlugIn)), plugInPath("widget")});
+  EXPECT_EQ(hold, std::string("error 11 request \"lock") + refusedTail);
+  EXPECT_EQ(server_->holds().size(), 0u);
+}
+
+}  // namespace
+}  // namespace vantrel::daemon::testing
