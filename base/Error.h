@@ -1,7 +1,8 @@
 #pragma once
 // Error objects: (domain, code, description). The daemon's own errors live in
-// the "Vantrel" domain; their codes are the table below, shared by error
-// objects and by the "errorcode" of error replies.
+// the "Vantrel" domain; their codes are protocol::ErrorCode (lmo/Protocol.h),
+// shared by error objects and by the "errorcode" of error replies. base sits
+// below lmo, so it takes the code as a plain integer.
 
 #include <cstdint>
 #include <optional>
@@ -12,17 +13,6 @@
 namespace vantrel::base {
 
 inline constexpr const char* VTErrorDomain = "Vantrel";
-
-// The system-wide error codes. Never 0: a client reads 0 as success.
-enum ErrorCode : int64_t {
-  kErrorRegistryRefused = 2,  // the application registry refused (un)registration
-  kErrorBadRequest = 4,       // malformed or unserviceable request; transport failure
-  kErrorVersionMismatch = 7,  // protocol or database version mismatch
-  kErrorBadPath = 9,          // bad or unknown path
-  kErrorAccessDenied = 11,    // access refused
-  kErrorInvalidPlugIn = 12,   // the plug-in's own configuration is invalid
-  kErrorBusy = 14,            // plug-ins are busy
-};
 
 struct Error {
   std::string domain;

@@ -29,6 +29,7 @@
 #include "daemon/VTDServer.h"
 #include "lmo/Connection.h"
 #include "lmo/Frame.h"
+#include "lmo/Protocol.h"
 #include "omnidex/Omnidex.h"
 
 namespace vantrel::bench {
@@ -49,9 +50,9 @@ constexpr auto kTeardownPoll = 5ms;
 // An empty change: the daemon validates it and replies {} without touching
 // the database.
 Dictionary annotateRequest() {
-  return Dictionary{{"request", Value("annotate")},
-                    {"version", Value::unsignedInteger(3)},
-                    {"annotations", Value(Dictionary{})}};
+  return Dictionary{{protocol::kKeyRequest, Value(protocol::kRequestAnnotate)},
+                    {protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion)},
+                    {protocol::kKeyAnnotations, Value(Dictionary{})}};
 }
 
 // The frames as they travel: the request, and the daemon's empty reply. The
@@ -242,9 +243,10 @@ BENCHMARK(BM_DaemonAnnotateRoundTrip)->UseRealTime()->Unit(benchmark::kMicroseco
 void BM_DaemonMatchOver10000(benchmark::State& state) {
   InProcessDaemon& server = InProcessDaemon::shared();
   const Dictionary request{
-      {"request", Value("match")},
-      {"version", Value::unsignedInteger(3)},
-      {"rules", Value(Dictionary{{"QXExtensionPointIdentifier", Value("com.bench.point42")}})}};
+      {protocol::kKeyRequest, Value(protocol::kRequestMatch)},
+      {protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion)},
+      {protocol::kKeyRules,
+       Value(Dictionary{{"QXExtensionPointIdentifier", Value("com.bench.point42")}})}};
   std::unique_ptr<Client> client;
   std::optional<std::string> failure;
   Dictionary reply;
@@ -254,7 +256,7 @@ void BM_DaemonMatchOver10000(benchmark::State& state) {
     client = std::make_unique<Client>(server.socket());
     failure = client->roundTrip(request, &reply);
   }
-  const lmo::Array* matches = reply.get("matches").getIfArray();
+  const lmo::Array* matches = reply.get(protocol::kKeyMatches).getIfArray();
   const size_t matched = matches ? matches->size() : 0;
   if (!failure && matched != 10000 / kExtensionPoints) {
     failure = "unexpected reply " + lmo::describe(reply).substr(0, 200);

@@ -14,29 +14,30 @@
 #include "lmo/Cbor.h"
 #include "lmo/Connection.h"
 #include "lmo/Listener.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::lmo {
 namespace {
 
 Dictionary smallRequest() {
-  return Dictionary{{"request", Value("annotate")},
-                    {"version", Value::unsignedInteger(3)},
-                    {"uuids", Value(Array{})},
-                    {"annotations", Value(Dictionary{})}};
+  return Dictionary{{protocol::kKeyRequest, Value(protocol::kRequestAnnotate)},
+                    {protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion)},
+                    {protocol::kKeyUuids, Value(Array{})},
+                    {protocol::kKeyAnnotations, Value(Dictionary{})}};
 }
 
 Dictionary typicalRequest() {
   Array uuids;
   for (int i = 0; i < 4; ++i) uuids = uuids.appending(Value(base::Uuid::random()));
-  return Dictionary{
-      {"request", Value("match")},
-      {"version", Value::unsignedInteger(3)},
-      {"flags", Value::unsignedInteger(0)},
-      {"uuids", Value(uuids)},
-      {"rules", Value(Dictionary{{"QXExtensionPointIdentifier", Value("com.example.share")},
-                                 {"NSExtensionActivationRule", Value("TRUEPREDICATE")},
-                                 {"count", Value::integer(-12)},
-                                 {"ratio", Value::real(0.5)}})}};
+  return Dictionary{{protocol::kKeyRequest, Value(protocol::kRequestMatch)},
+                    {protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion)},
+                    {protocol::kKeyFlags, Value::unsignedInteger(0)},
+                    {protocol::kKeyUuids, Value(uuids)},
+                    {protocol::kKeyRules,
+                     Value(Dictionary{{"QXExtensionPointIdentifier", Value("com.example.share")},
+                                      {"NSExtensionActivationRule", Value("TRUEPREDICATE")},
+                                      {"count", Value::integer(-12)},
+                                      {"ratio", Value::real(0.5)}})}};
 }
 
 void BM_LmoRoundTrip(benchmark::State& state) {

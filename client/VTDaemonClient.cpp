@@ -7,6 +7,7 @@
 #include "base/Format.h"
 #include "base/Log.h"
 #include "lmo/Message.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::client {
 namespace {
@@ -46,8 +47,8 @@ VTDaemonClient::VTDaemonClient(std::shared_ptr<lmo::Connection> connection,
 
 VTDaemonClientPtr VTDaemonClient::initWithServiceName(const char* name) {
   auto queue = std::make_shared<base::SerialQueue>(kReplyQueueLabel);
-  auto connection =
-      lmo::Connection::connectToService(name != nullptr ? name : kDefaultServiceName, queue);
+  auto connection = lmo::Connection::connectToService(
+      name != nullptr ? name : protocol::kDefaultServiceName, queue);
   // The daemon sends nothing unprompted, so every event that reaches the
   // connection itself is a failure. The handler captures nothing: it may run
   // after the proxy is gone.
@@ -66,16 +67,16 @@ VTDaemonClient::~VTDaemonClient() {
 }
 
 Dictionary VTDaemonClient::request(const char* type) const {
-  return Dictionary{{"request", Value(type)},
-                    {"version", Value::unsignedInteger(static_cast<uint64_t>(protocolVersion()))}};
+  return Dictionary{{protocol::kKeyRequest, Value(type)},
+                    {protocol::kKeyVersion, Value::unsignedInteger(protocolVersion())}};
 }
 
 Dictionary VTDaemonClient::request(const char* type, const std::vector<std::string>& paths) const {
-  return request(type).setting("paths", stringArray(paths));
+  return request(type).setting(protocol::kKeyPaths, stringArray(paths));
 }
 
 Dictionary VTDaemonClient::set(const Dictionary& message, const std::vector<base::Uuid>& uuids) {
-  return message.setting("uuids", uuidArray(uuids));
+  return message.setting(protocol::kKeyUuids, uuidArray(uuids));
 }
 
 base::Result<void> VTDaemonClient::send(const Dictionary& message, ReplyHandler reply) {
@@ -92,35 +93,41 @@ base::Result<void> VTDaemonClient::send(const Dictionary& message, ReplyHandler 
 
 base::Result<void> VTDaemonClient::addPlugIns(const std::vector<std::string>& paths,
                                               ReplyHandler reply) {
-  return send(request("add", paths), std::move(reply));
+  return send(request(protocol::kRequestAdd, paths), std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::removePlugIns(const std::vector<std::string>& paths,
                                                  ReplyHandler reply) {
-  return send(request("remove", paths), std::move(reply));
+  return send(request(protocol::kRequestRemove, paths), std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::bulkPlugins(uint64_t flags, ReplyHandler reply) {
-  return send(request("bulk").setting("flags", Value::unsignedInteger(flags)), std::move(reply));
+  return send(
+      request(protocol::kRequestBulk).setting(protocol::kKeyFlags, Value::unsignedInteger(flags)),
+      std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::readyPlugIns(const std::vector<base::Uuid>& uuids,
                                                 uint64_t flags, ReplyHandler reply) {
-  Dictionary message = request("ready").setting("flags", Value::unsignedInteger(flags));
+  Dictionary message =
+      request(protocol::kRequestReady).setting(protocol::kKeyFlags, Value::unsignedInteger(flags));
   return send(set(message, uuids), std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::accessPlugIns(const std::vector<base::Uuid>& uuids,
                                                  uint64_t flags, ReplyHandler reply) {
-  Dictionary message = request("access").setting("flags", Value::unsignedInteger(flags));
+  Dictionary message =
+      request(protocol::kRequestAccess).setting(protocol::kKeyFlags, Value::unsignedInteger(flags));
   return send(set(message, uuids), std::move(reply));
 }
 
-base::Result<void> VTDaemonClient::matchPlugIns(const Dictionary& rules, uint64_t flags,
+base::Result<void> VTDaemonClient::matchPlugIns(const Dictionary& rules,
+                                                protocol::DiscoveryFlags flags,
                                                 ReplyHandler reply) {
-  Dictionary message = request("match")
-                           .setting("rules", Value(lmo::propertyListFromMessage(rules)))
-                           .setting("flags", Value::unsignedInteger(flags));
+  Dictionary message =
+      request(protocol::kRequestMatch)
+          .setting(protocol::kKeyRules, Value(lmo::propertyListFromMessage(rules)))
+          .setting(protocol::kKeyFlags, Value::unsignedInteger(protocol::bits(flags)));
   return send(message, std::move(reply));
 }
 
@@ -128,20 +135,31 @@ base::Result<void> VTDaemonClient::setPluginAnnotations(const std::vector<base::
                                                         const Dictionary& annotations,
                                                         ReplyHandler reply) {
   Dictionary message =
-      set(request("annotate"), uuids)
-          .setting("annotations", Value(lmo::propertyListFromMessage(annotations)));
+      set(request(protocol::kRequestAnnotate), uuids)
+          .setting(protocol::kKeyAnnotations, Value(lmo::propertyListFromMessage(annotations)));
   return send(message, std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::holdPlugins(const std::vector<std::string>& paths,
-                                               uint64_t flags, ReplyHandler reply) {
-  return send(request("lock", paths).setting("flags", Value::unsignedInteger(flags)),
+                                               protocol::HoldFlags flags, ReplyHandler reply) {
+  return send(request(protocol::kRequestLock, paths)
+                  .setting(protocol::kKeyFlags, Value::unsignedInteger(protocol::bits(flags))),
               std::move(reply));
+}
+
+base::Result<void> VTDaemonClient::explainPlugIn(const Dictionary& selector, ReplyHandler reply) {
+  // The selector cannot change the request type or version: the envelope's
+  // keys are set last.
+  Dictionary message = selector;
+  for (const auto& [key, value] : request(protocol::kRequestExplain)) {
+    message = message.setting(key, value);
+  }
+  return send(message, std::move(reply));
 }
 
 base::Result<void> VTDaemonClient::releaseHold(const base::Uuid& token, ReplyHandler reply) {
   // The daemon tells a release from a hold by "uuids" being an array.
-  return send(set(request("lock"), {token}), std::move(reply));
+  return send(set(request(protocol::kRequestLock), {token}), std::move(reply));
 }
 
 base::Result<lmo::Event> VTDaemonClient::sendSyncWith(const RequestStarter& start,
@@ -156,7 +174,7 @@ base::Result<lmo::Event> VTDaemonClient::sendSyncWith(const RequestStarter& star
   if (!started.has_value()) return started.error();
   std::unique_lock lock(state->mutex);
   if (!state->arrived.wait_for(lock, timeout, [&] { return state->event.has_value(); })) {
-    return base::error_with_code_and_format(base::kErrorBadRequest,
+    return base::error_with_code_and_format(protocol::kErrorBadRequest,
                                             "no reply from vantreld within %u ms",
                                             static_cast<uint64_t>(timeout.count()));
   }
@@ -170,15 +188,15 @@ base::Result<lmo::Event> VTDaemonClient::sendSync(const Dictionary& message,
 
 std::optional<base::Error> VTDaemonClient::errorInReply(const lmo::Event& reply) {
   const lmo::IncomingMessage* message = reply.message();
-  if (message == nullptr) return base::error_with_code(base::kErrorBadRequest, describe(reply));
+  if (message == nullptr) return base::error_with_code(protocol::kErrorBadRequest, describe(reply));
   const Dictionary& body = message->body();
   // A code is sent sign-extended to 64 bits; only its low half is the code.
   // Both integer encodings are read, since a negative one may arrive signed.
-  const Value& codeValue = body.get("errorcode");
+  const Value& codeValue = body.get(protocol::kKeyErrorCode);
   uint64_t wire =
       codeValue.getIfUInt64().value_or(static_cast<uint64_t>(codeValue.getIfInt64().value_or(0)));
   const auto code = static_cast<int32_t>(static_cast<uint32_t>(wire));
-  const std::string* text = body.get("error").getIfString();
+  const std::string* text = body.get(protocol::kKeyError).getIfString();
   if (code == 0) {
     if (text != nullptr) {
       base::internalInconsistency(
@@ -194,15 +212,12 @@ std::optional<base::Error> VTDaemonClient::errorInReply(const lmo::Event& reply)
 }
 
 std::optional<Value> VTDaemonClient::convertFromLMO(const Dictionary& reply) const {
-  if (protocolVersion() != kCurrentProtocolVersion) return std::nullopt;
+  if (protocolVersion() != protocol::kCurrentVersion) return std::nullopt;
   return Value(lmo::propertyListFromMessage(reply));
 }
 
 std::optional<Value> VTDaemonClient::convertToLMO(const Value& object, uint64_t version) {
-  if (version != static_cast<uint64_t>(kCurrentProtocolVersion)) return std::nullopt;
-  // Messages and property lists share one value type: the conversion is the
-  // value itself, whatever its kind (a match reply's "matches" is an array).
-  return object;
+  return lmo::convertToLMO(object, version);
 }
 
 std::shared_ptr<lmo::Connection> VTDaemonClient::vantreld() const {

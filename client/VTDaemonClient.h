@@ -27,15 +27,12 @@
 #include "base/Uuid.h"
 #include "lmo/Connection.h"
 #include "lmo/Event.h"
+#include "lmo/Protocol.h"
 #include "lmo/Value.h"
 
 namespace vantrel::client {
 
-inline constexpr const char* kDefaultServiceName = "com.karvo.vantrel.vantreld";
 inline constexpr const char* kReplyQueueLabel = "vantreld_client";
-// The protocol version every request carries unless setProtocolVersion()
-// changed it; the only one whose replies convertFromLMO() understands.
-inline constexpr int64_t kCurrentProtocolVersion = 3;
 
 class VTDaemonClient;
 using VTDaemonClientPtr = std::shared_ptr<VTDaemonClient>;
@@ -47,8 +44,8 @@ class VTDaemonClient {
   // operation (or send) and returns that operation's result.
   using RequestStarter = std::function<base::Result<void>(ReplyHandler)>;
 
-  // Connects to the named service (null: kDefaultServiceName; a name that
-  // begins with "/" is the socket path itself). Never null in practice: when
+  // Connects to the named service (null: protocol::kDefaultServiceName; a
+  // name that begins with "/" is the socket path itself). Never null in practice: when
   // the service cannot be reached the connection is invalid from the start,
   // and every request's handler gets kConnectionInvalid.
   static VTDaemonClientPtr initWithServiceName(const char* name);
@@ -82,23 +79,30 @@ class VTDaemonClient {
                                   ReplyHandler reply);
   base::Result<void> accessPlugIns(const std::vector<base::Uuid>& uuids, uint64_t flags,
                                    ReplyHandler reply);
-  base::Result<void> matchPlugIns(const lmo::Dictionary& rules, uint64_t flags, ReplyHandler reply);
+  base::Result<void> matchPlugIns(const lmo::Dictionary& rules, protocol::DiscoveryFlags flags,
+                                  ReplyHandler reply);
   base::Result<void> setPluginAnnotations(const std::vector<base::Uuid>& uuids,
                                           const lmo::Dictionary& annotations, ReplyHandler reply);
   // Takes a hold; a successful reply carries the hold's token under "uuids".
-  base::Result<void> holdPlugins(const std::vector<std::string>& paths, uint64_t flags,
+  base::Result<void> holdPlugins(const std::vector<std::string>& paths, protocol::HoldFlags flags,
                                  ReplyHandler reply);
+  // "explain" (an extension beyond the base requests): the envelope plus
+  // the selector's keys (protocol::kKeyUuid, kKeyPath or kKeyIdentifier;
+  // kKeyPid or kKeyHostPath; kKeyRules, kKeyFlags). Without a plug-in the
+  // reply is the daemon's status.
+  base::Result<void> explainPlugIn(const lmo::Dictionary& selector, ReplyHandler reply);
   // Releases the hold that token names.
   base::Result<void> releaseHold(const base::Uuid& token, ReplyHandler reply);
 
   // For programs without an event loop: runs one request and blocks the
   // calling thread until its handler has run or timeout has passed, e.g.
-  //   client->sendSyncWith([&](auto h) { return client->holdPlugins(paths, 1, h); }, 5s);
-  // The value is what the handler got (the reply or kConnectionInvalid): give
-  // it to errorInReply(). Errors: start's own error, or code 4 "no reply from
-  // vantreld within %u ms" on timeout. A reply that comes after the timeout
-  // is dropped. Calling this on the reply queue would wait for itself: it
-  // stops the process.
+  //   client->sendSyncWith(
+  //       [&](auto h) { return client->holdPlugins(paths, HoldFlags::kPlugIn, h); }, 5s);
+  // The value is what the handler got (the reply or kConnectionInvalid):
+  // give it to errorInReply(). Errors: start's own error, or kErrorBadRequest
+  // "no reply from vantreld within %u ms" on timeout. A reply that comes
+  // after the timeout is dropped. Calling this on the reply queue would wait
+  // for itself: it stops the process.
   base::Result<lmo::Event> sendSyncWith(const RequestStarter& start,
                                         std::chrono::milliseconds timeout);
   // sendSyncWith for send(message, ...).
@@ -106,7 +110,7 @@ class VTDaemonClient {
                                     std::chrono::milliseconds timeout);
 
   // The error a reply stands for, or nullopt for success:
-  //  - an error event: code 4 with the event's description;
+  //  - an error event: kErrorBadRequest with the event's description;
   //  - "errorcode" (low 32 bits, signed) not 0: that code with "error", or a
   //    generic message when "error" is missing.
   // A reply with "error" but no code breaks the protocol and stops the
@@ -114,11 +118,11 @@ class VTDaemonClient {
   static std::optional<base::Error> errorInReply(const lmo::Event& reply);
 
   // The property-list object a reply holds; nullopt unless protocolVersion()
-  // is kCurrentProtocolVersion.
+  // is protocol::kCurrentVersion.
   std::optional<lmo::Value> convertFromLMO(const lmo::Dictionary& reply) const;
   // A property-list object as a message value (the daemon's match replies
   // carry an array of forms); nullopt unless version is
-  // kCurrentProtocolVersion.
+  // protocol::kCurrentVersion.
   static std::optional<lmo::Value> convertToLMO(const lmo::Value& object, uint64_t version);
 
   std::shared_ptr<lmo::Connection> vantreld() const;
@@ -130,8 +134,10 @@ class VTDaemonClient {
   // Where handlers of later requests run. The connection's own event handler
   // stays on the queue it was resumed with.
   void setReplyQueue(lmo::QueuePtr queue);
-  int64_t protocolVersion() const { return protocolVersion_.load(std::memory_order_relaxed); }
-  void setProtocolVersion(int64_t version) {
+  // The version every request carries: protocol::kCurrentVersion unless set
+  // otherwise, and the only one whose replies convertFromLMO() understands.
+  uint64_t protocolVersion() const { return protocolVersion_.load(std::memory_order_relaxed); }
+  void setProtocolVersion(uint64_t version) {
     protocolVersion_.store(version, std::memory_order_relaxed);
   }
 
@@ -142,7 +148,7 @@ class VTDaemonClient {
   std::shared_ptr<lmo::Connection> vantreld_;  // Guarded by mutex_.
   lmo::QueuePtr replyQueue_;                   // Guarded by mutex_.
   // Atomic: read by request operations on any thread.
-  std::atomic<int64_t> protocolVersion_{kCurrentProtocolVersion};
+  std::atomic<uint64_t> protocolVersion_{protocol::kCurrentVersion};
 };
 
 }  // namespace vantrel::client

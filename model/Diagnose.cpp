@@ -1,6 +1,7 @@
 // Validation of a plug-in's configuration: the metadata rules every plug-in
 // must meet on this platform.
 
+#include "lmo/Protocol.h"
 #include "model/MetadataKeys.h"
 #include "model/VTPlugInCore.h"
 
@@ -11,11 +12,11 @@ using lmo::Value;
 namespace {
 
 base::Error invalid(const char* message) {
-  return base::error_with_code(base::kErrorInvalidPlugIn, message);
+  return base::error_with_code(protocol::kErrorInvalidPlugIn, message);
 }
 
 base::Error missingKey(std::string_view key) {
-  return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+  return base::error_with_code_and_format(protocol::kErrorInvalidPlugIn,
                                           "missing \"%@\" key in Info.plist or SDK", key);
 }
 
@@ -28,12 +29,12 @@ std::optional<base::Error> VTPlugInCore::diagnose() const {
   if (protocolSpec().isNull()) return missingKey(kProtocolKey);
   if (!attributes()) return missingKey(kAttributesKey);
   if (isAppExtension() && principalSpec() != Value(kDefaultObjectClass)) {
-    return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+    return base::error_with_code_and_format(protocol::kErrorInvalidPlugIn,
                                             "Application Extensions may not use the \"%@\" key",
                                             kPrincipalClassKey);
   }
   if (!pluginKey(kPassProxyKey).isNull()) {
-    return base::error_with_code_and_format(base::kErrorInvalidPlugIn,
+    return base::error_with_code_and_format(protocol::kErrorInvalidPlugIn,
                                             "the \"%@\" key is not supported on this platform",
                                             kPassProxyKey);
   }

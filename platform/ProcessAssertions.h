@@ -25,10 +25,6 @@ inline constexpr const char* kInstancePidKey = "PID";
 // The bundle directory its executable lies in (a string).
 inline constexpr const char* kInstanceBundlePathKey = "BundlePath";
 
-// The key under which a conflict entry (a plug-in found running when a hold
-// was asked for) names the running bundle's identifier.
-inline constexpr const char* kExtensionBundleIdentifierKey = "ExtensionBundleIdentifier";
-
 // Entries of /proc examined by one scan. This is the kernel's own ceiling on
 // pids (PID_MAX_LIMIT), so the bound stops a runaway scan without ever
 // missing a process.

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "platform/ProcessAssertions.h"
 #include "registry/VTDPlugIn.h"
 
@@ -46,7 +47,7 @@ std::optional<lmo::Dictionary> VTDPlugIn::checkBusy(
   for (const lmo::Dictionary& instance : instances) {
     const lmo::Value& running = instance.get(platform::kInstanceBundleIdentifierKey);
     if (running.getIfString() != nullptr) {
-      return lmo::Dictionary{{platform::kExtensionBundleIdentifierKey, running}};
+      return lmo::Dictionary{{protocol::kKeyConflictBundleIdentifier, running}};
     }
     base::vtlog("tavold reported incomplete bundle for plug-in %@", identifier());
   }

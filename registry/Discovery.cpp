@@ -10,6 +10,7 @@
 #include <unordered_set>
 
 #include "base/Check.h"
+#include "lmo/Protocol.h"
 #include "registry/VTDAnnotationStore.h"
 #include "registry/VTDPlugIn.h"
 #include "registry/VTDatabase.h"
@@ -101,7 +102,7 @@ bool electionFilterAccepts(const std::vector<std::string>& filter, const std::st
   const std::string& key = replaced ? *replaced : identifier;
 
   std::optional<Dictionary> annotation = store.annotationForIdentifier(key);
-  Value election = annotation ? annotation->get(kElectionKey) : Value();
+  Value election = annotation ? annotation->get(protocol::kAnnotationElection) : Value();
   if (election.isNull()) {
     // Only a number counts here: a string entitlement elects the plug-in
     // once its record is built (auto-election), not before.

@@ -3,6 +3,7 @@
 // through setAnnotation is broadcast.
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "model/Collections.h"
 #include "platform/NotificationCenter.h"
 #include "registry/VTDatabase.h"
@@ -18,9 +19,10 @@ std::optional<lmo::Dictionary> VTDatabase::annotationForPlugIn(const VTDPlugIn& 
 void postAnnotationChange() {
   // The notification carries nothing, so a post that fails costs watchers
   // one refresh; it is logged and not reported.
-  base::Result<uint64_t> posted = platform::postNotification(kAnnotationChangeNotification);
+  base::Result<uint64_t> posted =
+      platform::postNotification(protocol::kAnnotationChangeNotification);
   if (!posted.has_value()) {
-    base::vtlog("unable to post notification %@: %@", kAnnotationChangeNotification,
+    base::vtlog("unable to post notification %@: %@", protocol::kAnnotationChangeNotification,
                 posted.error());
   }
 }
@@ -38,10 +40,11 @@ void VTDatabase::autoElect(const VTDPlugIn& plugIn) {
   sync_.assertCurrent();
   const lmo::Dictionary annotation =
       annotations_->annotationForPlugIn(plugIn).value_or(lmo::Dictionary());
-  const lmo::Value& election = annotation.get(kElectionKey);
+  const lmo::Value& election = annotation.get(protocol::kAnnotationElection);
   if (!election.isNull() && election.integerValue() != 0) return;
   annotations_->setAnnotation(
-      model::dictionaryChanging(annotation, kElectionKey, lmo::Value::integer(1)), plugIn);
+      model::dictionaryChanging(annotation, protocol::kAnnotationElection, lmo::Value::integer(1)),
+      plugIn);
 }
 
 }  // namespace vantrel::registry

@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "model/SandboxExtensionIssue.h"
 #include "model/VTBundle.h"
 #include "omnidex/PrivacyConsent.h"
@@ -70,7 +71,7 @@ void VTDPlugIn::augmentForm(lmo::Dictionary& form) const {
   lmo::Value shared = pluginKey("Shared");
   if (isAppExtension()) shared = lmo::Array{"."};
   if (shared.isNull()) return;
-  form = form.setting("extensions", issueResourceExtensions(shared));
+  form = form.setting(protocol::kKeyExtensions, issueResourceExtensions(shared));
 }
 
 std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) const {
@@ -111,7 +112,7 @@ std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) con
   // executable: only a regular, executable file will do.
   const std::optional<std::string> executable = bundle ? bundle->executablePath() : std::nullopt;
   if (!executable || platform::executableProblem(*executable)) {
-    return base::error_with_code_and_format(base::kErrorBadRequest,
+    return base::error_with_code_and_format(protocol::kErrorBadRequest,
                                             "cannot obtain executable path for plug-in %@(%@)",
                                             identifier(), uuidText);
   }
@@ -128,7 +129,7 @@ std::optional<base::Error> VTDPlugIn::enableForPid(pid_t pid, int hostPidfd) con
   if (!result.has_value()) {
     base::vtlog("lmo error %d allowing pid %d to use plug-in %@(%@) %@ at %@", result.error().code,
                 pid, identifier(), version(), uuidText, path());
-    return base::error_with_code_and_format(base::kErrorBadRequest,
+    return base::error_with_code_and_format(protocol::kErrorBadRequest,
                                             "unable to enable plug-in %@(%@) for pid %d",
                                             identifier(), uuidText, pid);
   }

@@ -6,6 +6,7 @@
 #include <string>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "model/VersionComparison.h"
 #include "platform/ActivationRules.h"
 #include "platform/TypeIdentifiers.h"
@@ -139,7 +140,7 @@ std::string VTDPlugIn::electionText() const {
   int64_t election = 0;
   if (std::shared_ptr<VTDatabase> database = database_.lock()) {
     if (auto annotation = database->annotationForPlugIn(*this)) {
-      election = annotation->get("election").integerValue();
+      election = annotation->get(protocol::kAnnotationElection).integerValue();
     }
   }
   return std::to_string(static_cast<int32_t>(election & ~kElectionHiddenBits));

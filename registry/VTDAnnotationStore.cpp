@@ -5,6 +5,7 @@
 
 #include "base/Check.h"
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "platform/AtomicFile.h"
 #include "platform/Paths.h"
 #include "platform/Probes.h"
@@ -101,7 +102,7 @@ bool VTDAnnotationStore::loadDb(base::Error* error) {
   const int64_t version = document ? document->get(kVersionKey).integerValue() : 0;
   if (version != kAnnotationDatabaseVersion) {
     if (error != nullptr) {
-      *error = base::error_with_code_and_format(base::kErrorVersionMismatch,
+      *error = base::error_with_code_and_format(protocol::kErrorVersionMismatch,
                                                 "found database version %d needed version %d",
                                                 version, kAnnotationDatabaseVersion);
       fireLoadProbe(*error);

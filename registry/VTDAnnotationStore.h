@@ -31,10 +31,6 @@ inline constexpr int64_t kFileNotFoundErrorCode = 260;
 // The domain of that error.
 inline constexpr const char* kAnnotationStoreErrorDomain = "AnnotationStore";
 
-// Annotation dictionary keys.
-inline constexpr std::string_view kElectionKey = "election";
-inline constexpr std::string_view kExtensionDataKey = "extension";
-
 class VTDAnnotationStore {
  public:
   VTDAnnotationStore() = default;

@@ -33,7 +33,7 @@ int32_t truncatedSeconds(const std::optional<lmo::Date>& date) {
 }
 
 base::Error invalid(const char* message) {
-  return base::error_with_code(base::kErrorInvalidPlugIn, message);
+  return base::error_with_code(protocol::kErrorInvalidPlugIn, message);
 }
 
 }  // namespace

@@ -157,7 +157,7 @@ class VTDPlugIn : public model::VTPlugInCore {
   // ---- Busy check ----
 
   // Null when no instance of the plug-in runs; otherwise a conflict entry
-  // naming the running bundle under platform::kExtensionBundleIdentifierKey.
+  // naming the running bundle under protocol::kKeyConflictBundleIdentifier.
   // An instance of any registered bundle with this plug-in's bundle
   // identifier counts, so registry is asked for those bundles. Scans /proc:
   // call it where a request may wait for that (the service queue). A caller

@@ -3,6 +3,7 @@
 #include "registry/VTDatabase.h"
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "omnidex/Omnidex.h"
 
 namespace vantrel::registry {
@@ -111,13 +112,13 @@ size_t VTDatabase::cacheCountForTest() {
 
 std::optional<base::Error> VTDatabase::addPlugIn(const model::FileUrl& url) {
   if (workspace_->registerPlugIn(url.path()).has_value()) return std::nullopt;
-  return base::error_with_code(base::kErrorRegistryRefused,
+  return base::error_with_code(protocol::kErrorRegistryRefused,
                                "Omnidex failed to register the plug-in");
 }
 
 std::optional<base::Error> VTDatabase::removePlugIn(const model::FileUrl& url) {
   if (workspace_->unregisterPlugIn(url.path()).has_value()) return std::nullopt;
-  return base::error_with_code(base::kErrorRegistryRefused,
+  return base::error_with_code(protocol::kErrorRegistryRefused,
                                "Omnidex failed to deregister the plug-in");
 }
 

@@ -36,11 +36,8 @@
 
 namespace vantrel::registry {
 
-// Posted, without payload, after every annotation change made through the
-// database.
-inline constexpr std::string_view kAnnotationChangeNotification =
-    "com.karvo.vantrel.annotation-change";
-// Posts kAnnotationChangeNotification; a failure is logged, not reported.
+// Posts protocol::kAnnotationChangeNotification; a failure is logged, not
+// reported.
 void postAnnotationChange();
 // The cache limit a database starts with.
 inline constexpr uint32_t kDefaultCacheLimit = 150;
@@ -128,7 +125,7 @@ class VTDatabase : public omnidex::WorkspaceObserver,
 
   std::optional<lmo::Dictionary> annotationForPlugIn(const VTDPlugIn& plugIn);
   // Merges (or, for nullopt, removes) the plug-in's annotation and saves,
-  // then, off the queue, posts kAnnotationChangeNotification, whatever
+  // then, off the queue, posts protocol::kAnnotationChangeNotification, whatever
   // happened to the save. Always returns null: a failed save or post is
   // only logged.
   std::optional<base::Error> setAnnotation(const std::optional<lmo::Dictionary>& annotation,

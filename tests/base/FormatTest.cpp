@@ -4,6 +4,7 @@
 
 #include "base/Error.h"
 #include "base/Result.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::base {
 namespace {
@@ -48,25 +49,25 @@ TEST(Format, PercentInArgumentIsNotAFormatAgain) {
 }
 
 TEST(Error, CodesAndDescriptions) {
-  Error plain = error_with_code(kErrorBadRequest, "unrecognized request");
+  Error plain = error_with_code(protocol::kErrorBadRequest, "unrecognized request");
   EXPECT_EQ(plain.domain, "Vantrel");
-  EXPECT_EQ(plain.code, 4);
+  EXPECT_EQ(plain.code, protocol::kErrorBadRequest);
   EXPECT_EQ(plain.localizedDescription, "unrecognized request");
 
-  Error bare = error_with_code(kErrorBusy, nullptr);
+  Error bare = error_with_code(protocol::kErrorBusy, nullptr);
   EXPECT_EQ(bare.domain, VTErrorDomain);
-  EXPECT_EQ(bare.code, 14);
+  EXPECT_EQ(bare.code, protocol::kErrorBusy);
   EXPECT_FALSE(bare.localizedDescription.has_value());
   EXPECT_EQ(bare.description(), "Vantrel error 14");
 
   Error formatted =
-      error_with_code_and_format(kErrorBadPath, "no plugin at %@", std::string("/a b"));
+      error_with_code_and_format(protocol::kErrorBadPath, "no plugin at %@", std::string("/a b"));
   EXPECT_EQ(formatted.localizedDescription, "no plugin at /a b");
-  EXPECT_FALSE(error_with_code_and_format(kErrorBadPath, nullptr).localizedDescription);
+  EXPECT_FALSE(error_with_code_and_format(protocol::kErrorBadPath, nullptr).localizedDescription);
 }
 
 Result<int> half(int n) {
-  if (n % 2 != 0) return error_with_code_and_format(kErrorBadRequest, "odd: %d", n);
+  if (n % 2 != 0) return error_with_code_and_format(protocol::kErrorBadRequest, "odd: %d", n);
   return n / 2;
 }
 

@@ -14,6 +14,7 @@
 
 #include "base/Log.h"
 #include "lmo/Listener.h"
+#include "lmo/Protocol.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::client {
@@ -143,7 +144,7 @@ TEST(VTDaemonClient, EveryRequestSendsExactlyItsMessage) {
   testing::TempDir dir;
   // The default service name, found in the runtime directory.
   ASSERT_EQ(::setenv("VANTREL_RUNTIME_DIR", dir.path().c_str(), 1), 0);
-  FakeDaemon daemon(kDefaultServiceName);
+  FakeDaemon daemon(protocol::kDefaultServiceName);
   auto client = VTDaemonClient::initWithServiceName(nullptr);
   ::unsetenv("VANTREL_RUNTIME_DIR");
 
@@ -151,27 +152,45 @@ TEST(VTDaemonClient, EveryRequestSendsExactlyItsMessage) {
   const std::vector<base::Uuid> ab{a, b}, ba{b, a};
   const Dictionary rules{{"QXExtensionPoint", "com.x.share"},
                          {"nested", Dictionary{{"list", Array{u(1), "two"}}}}};
-  const Dictionary annotations{{"election", u(1)}};
+  const Dictionary annotations{{protocol::kAnnotationElection, u(1)}};
   const std::vector<std::string> list{"/A.app/PlugIns/x.qxt", "/B"};
   const Array paths{"/A.app/PlugIns/x.qxt", "/B"};
   const std::vector<std::pair<VTDaemonClient::RequestStarter, Dictionary>> cases = {
-      {[&](auto h) { return client->addPlugIns(list, h); }, {{"request", "add"}, {"paths", paths}}},
+      {[&](auto h) { return client->addPlugIns(list, h); },
+       {{protocol::kKeyRequest, protocol::kRequestAdd}, {protocol::kKeyPaths, paths}}},
       {[&](auto h) { return client->removePlugIns({}, h); },
-       {{"request", "remove"}, {"paths", Array{}}}},
+       {{protocol::kKeyRequest, protocol::kRequestRemove}, {protocol::kKeyPaths, Array{}}}},
       {[&](auto h) { return client->bulkPlugins(0x8000000000000001, h); },
-       {{"request", "bulk"}, {"flags", u(0x8000000000000001)}}},
+       {{protocol::kKeyRequest, protocol::kRequestBulk},
+        {protocol::kKeyFlags, u(0x8000000000000001)}}},
       {[&](auto h) { return client->readyPlugIns(ba, 2, h); },
-       {{"request", "ready"}, {"flags", u(2)}, {"uuids", Array{b, a}}}},
+       {{protocol::kKeyRequest, protocol::kRequestReady},
+        {protocol::kKeyFlags, u(2)},
+        {protocol::kKeyUuids, Array{b, a}}}},
       {[&](auto h) { return client->accessPlugIns({a}, 0, h); },
-       {{"request", "access"}, {"flags", u(0)}, {"uuids", Array{a}}}},
-      {[&](auto h) { return client->matchPlugIns(rules, 4, h); },
-       {{"request", "match"}, {"rules", rules}, {"flags", u(4)}}},
+       {{protocol::kKeyRequest, protocol::kRequestAccess},
+        {protocol::kKeyFlags, u(0)},
+        {protocol::kKeyUuids, Array{a}}}},
+      {[&](auto h) {
+         return client->matchPlugIns(rules, protocol::DiscoveryFlags::kDuplicates, h);
+       },
+       {{protocol::kKeyRequest, protocol::kRequestMatch},
+        {protocol::kKeyRules, rules},
+        {protocol::kKeyFlags, u(protocol::bits(protocol::DiscoveryFlags::kDuplicates))}}},
       {[&](auto h) { return client->setPluginAnnotations(ab, annotations, h); },
-       {{"request", "annotate"}, {"uuids", Array{a, b}}, {"annotations", annotations}}},
-      {[&](auto h) { return client->holdPlugins(list, 1, h); },
-       {{"request", "lock"}, {"paths", paths}, {"flags", u(1)}}},
+       {{protocol::kKeyRequest, protocol::kRequestAnnotate},
+        {protocol::kKeyUuids, Array{a, b}},
+        {protocol::kKeyAnnotations, annotations}}},
+      {[&](auto h) { return client->holdPlugins(list, protocol::HoldFlags::kApplication, h); },
+       {{protocol::kKeyRequest, protocol::kRequestLock},
+        {protocol::kKeyPaths, paths},
+        {protocol::kKeyFlags, u(protocol::bits(protocol::HoldFlags::kApplication))}}},
       {[&](auto h) { return client->releaseHold(b, h); },
-       {{"request", "lock"}, {"uuids", Array{b}}}},
+       {{protocol::kKeyRequest, protocol::kRequestLock}, {protocol::kKeyUuids, Array{b}}}},
+      {[&](auto h) {
+         return client->explainPlugIn({{protocol::kKeyIdentifier, "com.x"}}, h);
+       },
+       {{protocol::kKeyRequest, protocol::kRequestExplain}, {protocol::kKeyIdentifier, "com.x"}}},
   };
   for (size_t i = 0; i < cases.size(); ++i) {
     auto outcome = client->sendSyncWith(cases[i].first, 10s);
@@ -180,7 +199,8 @@ TEST(VTDaemonClient, EveryRequestSendsExactlyItsMessage) {
     const Dictionary sent = daemon.received(i + 1).at(i);
     // Equality is numeric and the wire keeps no sign for small numbers: a
     // flags value with the top bit set shows that flags travel unsigned.
-    EXPECT_EQ(sent, cases[i].second.setting("version", u(3))) << describe(sent);
+    EXPECT_EQ(sent, cases[i].second.setting(protocol::kKeyVersion, u(protocol::kCurrentVersion)))
+        << describe(sent);
   }
 }
 
@@ -188,17 +208,18 @@ TEST(VTDaemonClient, ProtocolVersionGovernsMessagesAndConversions) {
   testing::TempDir dir;
   FakeDaemon daemon(dir.file("svc"));
   auto client = VTDaemonClient::initWithServiceName(dir.file("svc").c_str());
-  const Dictionary reply{{"matches", Array{Dictionary{{"id", "x"}}}}};
+  const Dictionary reply{{protocol::kKeyMatches, Array{Dictionary{{"id", "x"}}}}};
   EXPECT_EQ(client->convertFromLMO(reply), Value(reply));
-  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(reply), 3), Value(reply));
-  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(reply), 2), std::nullopt);
-  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(lmo::Array{"form"}), 3), Value(lmo::Array{"form"}));
+  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(reply), protocol::kCurrentVersion), Value(reply));
+  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(reply), protocol::kOldestVersion), std::nullopt);
+  EXPECT_EQ(VTDaemonClient::convertToLMO(Value(lmo::Array{"form"}), protocol::kCurrentVersion),
+            Value(lmo::Array{"form"}));
 
-  client->setProtocolVersion(2);
-  const Dictionary bulk = client->request("bulk");
-  EXPECT_TRUE(bulk.get("version").isUnsignedInteger());
+  client->setProtocolVersion(protocol::kOldestVersion);
+  const Dictionary bulk = client->request(protocol::kRequestBulk);
+  EXPECT_TRUE(bulk.get(protocol::kKeyVersion).isUnsignedInteger());
   ASSERT_TRUE(client->sendSync(bulk, 10s).has_value());
-  EXPECT_EQ(daemon.received(1).at(0).get("version"), u(2));
+  EXPECT_EQ(daemon.received(1).at(0).get(protocol::kKeyVersion), u(protocol::kOldestVersion));
   EXPECT_EQ(client->convertFromLMO(reply), std::nullopt);
 }
 
@@ -206,38 +227,48 @@ TEST(VTDaemonClient, ErrorInReplyDecodesEveryReplyShape) {
   const auto error = static_cast<base::Error (*)(int64_t, const char*)>(base::error_with_code);
   const std::vector<std::pair<Event, std::optional<base::Error>>> cases = {
       {replyWith({}), std::nullopt},
-      {replyWith({{"matches", Array{}}, {"errorcode", u(0)}}), std::nullopt},
-      {replyWith({{"errorcode", u(14)}, {"error", "plug-ins are busy"}}),
-       error(14, "plug-ins are busy")},
-      {replyWith({{"errorcode", u(9)}}), error(9, "unknown error returned by Vantrel subsystem")},
-      {replyWith({{"errorcode", u(9)}, {"error", u(5)}}),
-       error(9, "unknown error returned by Vantrel subsystem")},
-      {replyWith({{"errorcode", u(0xFFFFFFFF)}, {"error", "x"}}), error(-1, "x")},
-      {replyWith({{"errorcode", u(0xFFFFFFFFFFFFFFF2)}, {"error", "x"}}), error(-14, "x")},
-      {replyWith({{"errorcode", Value::integer(-7)}, {"error", "x"}}), error(-7, "x")},
-      {replyWith({{"errorcode", u(0x100000007)}, {"error", "x"}}), error(7, "x")},
-      {Event(lmo::ErrorEvent::kConnectionInvalid), error(4, "connection invalid")},
+      {replyWith({{protocol::kKeyMatches, Array{}}, {protocol::kKeyErrorCode, u(0)}}),
+       std::nullopt},
+      {replyWith({{protocol::kKeyErrorCode, u(protocol::kErrorBusy)},
+                  {protocol::kKeyError, "plug-ins are busy"}}),
+       error(protocol::kErrorBusy, "plug-ins are busy")},
+      {replyWith({{protocol::kKeyErrorCode, u(protocol::kErrorBadPath)}}),
+       error(protocol::kErrorBadPath, "unknown error returned by Vantrel subsystem")},
+      {replyWith(
+           {{protocol::kKeyErrorCode, u(protocol::kErrorBadPath)}, {protocol::kKeyError, u(5)}}),
+       error(protocol::kErrorBadPath, "unknown error returned by Vantrel subsystem")},
+      {replyWith({{protocol::kKeyErrorCode, u(0xFFFFFFFF)}, {protocol::kKeyError, "x"}}),
+       error(-1, "x")},
+      {replyWith({{protocol::kKeyErrorCode, u(0xFFFFFFFFFFFFFFF2)}, {protocol::kKeyError, "x"}}),
+       error(-14, "x")},
+      {replyWith({{protocol::kKeyErrorCode, Value::integer(-7)}, {protocol::kKeyError, "x"}}),
+       error(-7, "x")},
+      {replyWith({{protocol::kKeyErrorCode, u(0x100000007)}, {protocol::kKeyError, "x"}}),
+       error(7, "x")},
+      {Event(lmo::ErrorEvent::kConnectionInvalid),
+       error(protocol::kErrorBadRequest, "connection invalid")},
   };
   for (const auto& [reply, expected] : cases) {
     EXPECT_EQ(VTDaemonClient::errorInReply(reply), expected) << describe(reply);
   }
   // A code whose low half is 0 is no code: with a message, the protocol is broken.
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(
-      VTDaemonClient::errorInReply(replyWith({{"errorcode", u(1ull << 32)}, {"error", "hi"}})),
-      "vantreld reported error without a code: hi");
+  EXPECT_DEATH(VTDaemonClient::errorInReply(replyWith(
+                   {{protocol::kKeyErrorCode, u(1ull << 32)}, {protocol::kKeyError, "hi"}})),
+               "vantreld reported error without a code: hi");
 }
 
 TEST(VTDaemonClient, EachHandlerRunsOnceOnTheReplyQueue) {
   testing::TempDir dir;
   FakeDaemon daemon(dir.file("svc"));
-  daemon.script({{Answer::kReply, {{"matches", Array{}}}}, {Answer::kClose, {}}});
+  daemon.script({{Answer::kReply, {{protocol::kKeyMatches, Array{}}}}, {Answer::kClose, {}}});
   base::LogCapture log;
   auto client = VTDaemonClient::initWithServiceName(dir.file("svc").c_str());
   const lmo::QueuePtr queue = client->replyQueue();
   EXPECT_EQ(queue->label(), "vantreld_client");
   auto replies = std::make_shared<Replies>();
-  ASSERT_TRUE(client->matchPlugIns({}, 0, recordInto(replies, queue)).has_value());
+  ASSERT_TRUE(client->matchPlugIns({}, protocol::DiscoveryFlags::kNone, recordInto(replies, queue))
+                  .has_value());
   ASSERT_EQ(replies->waitFor(1).size(), 1u);
   // The daemon closes the connection instead of answering; later requests
   // on the dead connection are answered the same way.
@@ -249,17 +280,19 @@ TEST(VTDaemonClient, EachHandlerRunsOnceOnTheReplyQueue) {
   // A message the codec refuses is not sent, and its handler never runs.
   Dictionary deep;
   for (int i = 0; i < 100; ++i) deep = Dictionary{{"d", deep}};
-  EXPECT_FALSE(client->matchPlugIns(deep, 0, recordInto(replies, queue)).has_value());
+  EXPECT_FALSE(
+      client->matchPlugIns(deep, protocol::DiscoveryFlags::kNone, recordInto(replies, queue))
+          .has_value());
 
   const auto events = replies->waitFor(3);
   ASSERT_EQ(events.size(), 3u);
   queue->sync([] {});  // anything queued before now has run
   EXPECT_EQ(replies->waitFor(0).size(), 3u);
   for (const auto& [event, onQueue] : events) EXPECT_TRUE(onQueue) << describe(event);
-  EXPECT_EQ(events[0].first.message()->body(), Dictionary({{"matches", Array{}}}));
+  EXPECT_EQ(events[0].first.message()->body(), Dictionary({{protocol::kKeyMatches, Array{}}}));
   for (size_t i : {1, 2}) {
     EXPECT_EQ(VTDaemonClient::errorInReply(events[i].first),
-              base::error_with_code(4, "connection invalid"));
+              base::error_with_code(protocol::kErrorBadRequest, "connection invalid"));
   }
   EXPECT_EQ(log.count(ended), 1u);
 
@@ -284,11 +317,12 @@ TEST(VTDaemonClient, SendSyncWaitsForItsOwnReplyOrGivesUp) {
   FakeDaemon daemon(dir.file("svc"));
   daemon.script({{Answer::kHold, {}}, {Answer::kReply, {{"ok", u(1)}}}});
   auto client = VTDaemonClient::initWithServiceName(dir.file("svc").c_str());
-  auto timedOut = client->sendSync(client->request("bulk"), 50ms);
+  auto timedOut = client->sendSync(client->request(protocol::kRequestBulk), 50ms);
   ASSERT_FALSE(timedOut.has_value());
-  EXPECT_EQ(timedOut.error(), base::error_with_code(4, "no reply from vantreld within 50 ms"));
+  EXPECT_EQ(timedOut.error(), base::error_with_code(protocol::kErrorBadRequest,
+                                                    "no reply from vantreld within 50 ms"));
   daemon.answerHeld({{"late", u(1)}});  // dropped: nobody waits for it any more
-  auto answered = client->sendSync(client->request("bulk"), 10s);
+  auto answered = client->sendSync(client->request(protocol::kRequestBulk), 10s);
   ASSERT_TRUE(answered.has_value());
   EXPECT_EQ(answered.value().message()->body(), Dictionary({{"ok", u(1)}}));
 

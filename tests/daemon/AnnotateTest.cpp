@@ -21,43 +21,54 @@ using Annotate = DaemonTest;
 TEST_F(Annotate, MalformedChangesTouchNothing) {
   const Value uuids = Array{uuidOf("widget")};
   const std::pair<Value, Expected> cases[] = {
-      {Value(), {4, "invalid request format (bad annotations dictionary)"}},
-      {Array{}, {4, "invalid request format (bad annotations dictionary)"}},
-      {Dictionary{{"election", "1"}}, {4, "invalid request format (annotation election)"}},
-      {Dictionary{{"extension", Array{}}}, {4, "invalid request format (annotation extension)"}},
-      {Dictionary{{"election", "1"}, {"extension", Array{}}},
-       {4, "invalid request format (annotation election)"}},
+      {Value(),
+       {protocol::kErrorBadRequest, "invalid request format (bad annotations dictionary)"}},
+      {Array{},
+       {protocol::kErrorBadRequest, "invalid request format (bad annotations dictionary)"}},
+      {Dictionary{{protocol::kAnnotationElection, "1"}},
+       {protocol::kErrorBadRequest, "invalid request format (annotation election)"}},
+      {Dictionary{{protocol::kAnnotationExtension, Array{}}},
+       {protocol::kErrorBadRequest, "invalid request format (annotation extension)"}},
+      {Dictionary{{protocol::kAnnotationElection, "1"}, {protocol::kAnnotationExtension, Array{}}},
+       {protocol::kErrorBadRequest, "invalid request format (annotation election)"}},
   };
   for (const auto& [annotations, expected] : cases) {
-    const Dictionary extras = Dictionary{{"uuids", uuids}}.setting("annotations", annotations);
-    EXPECT_EQ(errorOf(request("annotate", extras)), expected) << lmo::describe(annotations);
+    const Dictionary extras =
+        Dictionary{{protocol::kKeyUuids, uuids}}.setting(protocol::kKeyAnnotations, annotations);
+    EXPECT_EQ(errorOf(request(protocol::kRequestAnnotate, extras)), expected)
+        << lmo::describe(annotations);
   }
   // A change without a known key succeeds without looking at "uuids".
-  EXPECT_EQ(errorOf(request("annotate", {{"annotations", Dictionary{{"colour", "red"}}},
-                                         {"uuids", "garbage"}})),
+  EXPECT_EQ(errorOf(request(protocol::kRequestAnnotate,
+                            {{protocol::kKeyAnnotations, Dictionary{{"colour", "red"}}},
+                             {protocol::kKeyUuids, "garbage"}})),
             Expected(0, ""));
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), std::nullopt);
-  EXPECT_EQ(platform::notificationCount(registry::kAnnotationChangeNotification), 0u);
+  EXPECT_EQ(platform::notificationCount(protocol::kAnnotationChangeNotification), 0u);
 }
 
 TEST_F(Annotate, StoresTheKnownKeysAndAnnounces) {
   base::LogCapture log;
   const Dictionary settings{{"size", Value::integer(2)}};
   const Dictionary reply = request(
-      "annotate",
-      {{"uuids", Array{uuidOf("widget"), uuidOf("share")}},
-       {"annotations",
-        Dictionary{{"election", Value::integer(0)}, {"extension", settings}, {"colour", "red"}}}});
+      protocol::kRequestAnnotate,
+      {{protocol::kKeyUuids, Array{uuidOf("widget"), uuidOf("share")}},
+       {protocol::kKeyAnnotations, Dictionary{{protocol::kAnnotationElection, Value::integer(0)},
+                                              {protocol::kAnnotationExtension, settings},
+                                              {"colour", "red"}}}});
   EXPECT_TRUE(reply.empty()) << lmo::describe(reply);
-  const Dictionary stored{{"election", Value::integer(0)}, {"extension", settings}};
+  const Dictionary stored{{protocol::kAnnotationElection, Value::integer(0)},
+                          {protocol::kAnnotationExtension, settings}};
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), stored);
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("share")), stored);
-  EXPECT_EQ(platform::notificationCount(registry::kAnnotationChangeNotification), 2u);
+  EXPECT_EQ(platform::notificationCount(protocol::kAnnotationChangeNotification), 2u);
   EXPECT_TRUE(log.contains(" plug-in com.x.widget election := 0"));
 
   // Only the extension: the election stays, and the log shows none given.
-  request("annotate", {{"uuids", Array{uuidOf("widget")}},
-                       {"annotations", Dictionary{{"extension", Dictionary{}}}}});
+  request(
+      protocol::kRequestAnnotate,
+      {{protocol::kKeyUuids, Array{uuidOf("widget")}},
+       {protocol::kKeyAnnotations, Dictionary{{protocol::kAnnotationExtension, Dictionary{}}}}});
   EXPECT_TRUE(log.contains(" plug-in com.x.widget election := (null)"));
 
   // The store's file on disk is what a restarted daemon reads.

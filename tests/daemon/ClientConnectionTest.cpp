@@ -21,8 +21,6 @@ using namespace std::chrono_literals;
 using lmo::Dictionary;
 using lmo::Value;
 
-constexpr const char* kManager = "com.karvo.private.vantrel.manager";
-
 using ClientConnection = DaemonTest;
 
 TEST_F(ClientConnection, EntitlementsOfARealPeer) {
@@ -32,8 +30,9 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
   omnidex::testing::writeBundle(
       bundle, {{"KBBundleIdentifier", "com.x.manager"}, {"KBBundleExecutable", "peer"}});
   ASSERT_TRUE(vantrel::testing::installTestPeer(bundle + "/peer"));
-  const Dictionary entitlements{
-      {kManager, Value::boolean(true)}, {"string", "yes"}, {"off", Value::boolean(false)}};
+  const Dictionary entitlements{{std::string(protocol::kManagerEntitlement), Value::boolean(true)},
+                                {"string", "yes"},
+                                {"off", Value::boolean(false)}};
   ASSERT_TRUE(
       platform::writePropertyListFile(bundle + "/Entitlements.plist", Value(entitlements), 0644)
           .has_value());
@@ -57,7 +56,7 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
 
   EXPECT_EQ(client->pid(), peer->pid());
   ASSERT_NE(client->bundle(), nullptr);
-  EXPECT_TRUE(client->hasEntitlement(kManager));
+  EXPECT_TRUE(client->hasEntitlement(protocol::kManagerEntitlement));
   EXPECT_TRUE(client->hasEntitlement("string"));
   EXPECT_FALSE(client->hasEntitlement("off"));
   EXPECT_FALSE(client->hasEntitlement("missing"));
@@ -72,7 +71,7 @@ TEST_F(ClientConnection, EntitlementsOfARealPeer) {
   peer->wait();
   ASSERT_TRUE(eventually([&] { return !client->acceptWork(); }));
   EXPECT_EQ(client->pid(), peer->pid());
-  EXPECT_TRUE(client->hasEntitlement(kManager));
+  EXPECT_TRUE(client->hasEntitlement(protocol::kManagerEntitlement));
   EXPECT_TRUE(client->description().ends_with(" NO CONNECTION>"));
 }
 
@@ -81,10 +80,12 @@ TEST_F(ClientConnection, EveryThousandthRequestIsReported) {
   const std::string line = "client " + std::to_string(::getpid()) + " used 1000 requests so far";
   auto connection = connect();
   base::LogCapture log;
-  for (int i = 0; i < 999; ++i) request("annotate", {{"annotations", Dictionary{}}}, connection);
+  for (int i = 0; i < 999; ++i) {
+    request(protocol::kRequestAnnotate, {{protocol::kKeyAnnotations, Dictionary{}}}, connection);
+  }
   EXPECT_EQ(log.count(line), 0u);
-  request("annotate", {{"annotations", Dictionary{}}}, connection);
-  request("annotate", {{"annotations", Dictionary{}}}, connection);
+  request(protocol::kRequestAnnotate, {{protocol::kKeyAnnotations, Dictionary{}}}, connection);
+  request(protocol::kRequestAnnotate, {{protocol::kKeyAnnotations, Dictionary{}}}, connection);
   EXPECT_EQ(log.count(line), 1u);
 }
 

@@ -116,8 +116,8 @@ std::optional<lmo::Dictionary> DaemonTest::send(
 
 lmo::Dictionary DaemonTest::request(const char* type, lmo::Dictionary extras,
                                     const std::shared_ptr<lmo::Connection>& connection) {
-  lmo::Dictionary message =
-      extras.setting("request", type).setting("version", lmo::Value::unsignedInteger(3));
+  lmo::Dictionary message = extras.setting(protocol::kKeyRequest, type)
+                                .setting(protocol::kKeyVersion, u64(protocol::kCurrentVersion));
   return send(message, connection)
       .value_or(lmo::Dictionary{{"no reply", lmo::Value::boolean(true)}});
 }
@@ -146,8 +146,8 @@ bool DaemonTest::eventually(const std::function<bool()>& condition) {
 }
 
 Expected errorOf(const lmo::Dictionary& reply) {
-  const std::string* message = reply.get("error").getIfString();
-  return {reply.get("errorcode").integerValue(), message ? *message : ""};
+  const std::string* message = reply.get(protocol::kKeyError).getIfString();
+  return {reply.get(protocol::kKeyErrorCode).integerValue(), message ? *message : ""};
 }
 
 }  // namespace vantrel::daemon::testing

@@ -12,6 +12,7 @@
 
 #include "daemon/VTDServer.h"
 #include "lmo/Connection.h"
+#include "lmo/Protocol.h"
 #include "lmo/Value.h"
 #include "omnidex/Omnidex.h"
 #include "tests/support/TempDir.h"
@@ -55,7 +56,8 @@ class DaemonTest : public ::testing::Test {
   // reply: its body, or nullopt (after a test failure) when none came.
   std::optional<lmo::Dictionary> send(const lmo::Dictionary& message,
                                       const std::shared_ptr<lmo::Connection>& connection = nullptr);
-  // {"request": type, "version": 3} plus extras, sent and answered.
+  // {"request": type, "version": protocol::kCurrentVersion} plus extras, sent
+  // and answered.
   lmo::Dictionary request(const char* type, lmo::Dictionary extras = {},
                           const std::shared_ptr<lmo::Connection>& connection = nullptr);
   // The directory of platform::ServiceManager::shared() (launch descriptions
@@ -85,6 +87,10 @@ Expected errorOf(const lmo::Dictionary& reply);
 // The unsigned integers the protocol's "version" and "flags" are.
 inline lmo::Value u64(uint64_t v) {
   return lmo::Value::unsignedInteger(v);
+}
+template <protocol::FlagEnum Flags>
+lmo::Value u64(Flags flags) {
+  return u64(protocol::bits(flags));
 }
 
 }  // namespace vantrel::daemon::testing

@@ -65,21 +65,23 @@ class Discovery : public DaemonTest {
   }
 
   lmo::Array matches(const lmo::Dictionary& extras) {
-    const lmo::Dictionary reply = request("match", extras);
-    const lmo::Array* forms = reply.get("matches").getIfArray();
+    const lmo::Dictionary reply = request(protocol::kRequestMatch, extras);
+    const lmo::Array* forms = reply.get(protocol::kKeyMatches).getIfArray();
     EXPECT_NE(forms, nullptr) << lmo::describe(reply);
     return forms ? *forms : lmo::Array{};
   }
-  Ids matching(const lmo::Dictionary& rules, uint64_t flags = 0) {
+  Ids matching(const lmo::Dictionary& rules,
+               protocol::DiscoveryFlags flags = protocol::DiscoveryFlags::kNone) {
     Ids ids;
-    for (const lmo::Value& form : matches({{"rules", rules}, {"flags", u64(flags)}})) {
-      ids.insert(*form.getIfDictionary()->get("identifier").getIfString());
+    for (const lmo::Value& form :
+         matches({{protocol::kKeyRules, rules}, {protocol::kKeyFlags, u64(flags)}})) {
+      ids.insert(*form.getIfDictionary()->get(protocol::kFormIdentifier).getIfString());
     }
     return ids;
   }
   static lmo::Dictionary formOf(const lmo::Array& forms, const std::string& identifier) {
     for (const lmo::Value& form : forms) {
-      if (form.getIfDictionary()->get("identifier") == lmo::Value(identifier)) {
+      if (form.getIfDictionary()->get(protocol::kFormIdentifier) == lmo::Value(identifier)) {
         return *form.getIfDictionary();
       }
     }
@@ -97,6 +99,10 @@ class Discovery : public DaemonTest {
                                                 lmo::Value(entitlements), 0644)
                     .has_value());
     return bundle + "/peer";
+  }
+  // The line a test peer writes for an error reply.
+  static std::string peerError(int64_t code, const std::string& message) {
+    return "error " + std::to_string(code) + " " + message;
   }
   // Starts peer with the "request" mode, through setpriv --no-new-privs when
   // sandboxed; its answer line is *answer. The peer runs until destroyed.

@@ -20,9 +20,8 @@ using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
 
-constexpr const char* kManager = "com.karvo.private.vantrel.manager";
 constexpr const char* kAllowedPlugIns = "com.karvo.developer.vantrel.allowedplugins";
-constexpr uint64_t kDiscoverAll = 0x200;
+using protocol::DiscoveryFlags;
 
 TEST_F(Discovery, RulePatterns) {
   base::LogCapture log;
@@ -83,8 +82,10 @@ TEST_F(Discovery, SpecialKeysAndReplyForms) {
   EXPECT_EQ(matching({{"QXUserElection", "0"}}), both);
 
   // The election's bits 8 to 15 are not seen.
-  request("annotate", {{"uuids", Array{uuidOf("widget")}},
-                       {"annotations", Dictionary{{"election", Value::integer(258)}}}});
+  request(protocol::kRequestAnnotate,
+          {{protocol::kKeyUuids, Array{uuidOf("widget")}},
+           {protocol::kKeyAnnotations,
+            Dictionary{{protocol::kAnnotationElection, Value::integer(258)}}}});
   EXPECT_EQ(matching({{"QXUserElection", "2"}}), widget);
   EXPECT_EQ(matching({{"QXUserElection", "0"}}), share);
 
@@ -92,30 +93,34 @@ TEST_F(Discovery, SpecialKeysAndReplyForms) {
   // for the bundle itself.
   const Array forms = matches({});
   ASSERT_EQ(forms.size(), 2u);
-  EXPECT_EQ(formOf(forms, kWidget).get("annotations"),
-            Value(Dictionary{{"election", Value::integer(258)}}));
-  EXPECT_EQ(formOf(forms, kShare).get("annotations"), Value(Dictionary{}));
+  EXPECT_EQ(formOf(forms, kWidget).get(protocol::kFormAnnotations),
+            Value(Dictionary{{protocol::kAnnotationElection, Value::integer(258)}}));
+  EXPECT_EQ(formOf(forms, kShare).get(protocol::kFormAnnotations), Value(Dictionary{}));
   for (const Value& form : forms) {
-    const Dictionary* extensions = form.getIfDictionary()->get("extensions").getIfDictionary();
+    const Dictionary* extensions =
+        form.getIfDictionary()->get(protocol::kKeyExtensions).getIfDictionary();
     ASSERT_NE(extensions, nullptr) << lmo::describe(form);
     EXPECT_NE(extensions->get(".").getIfString(), nullptr) << lmo::describe(form);
   }
 
   // Version 2: success without "matches".
-  const Dictionary old = *send({{"request", "match"}, {"version", u64(2)}});
+  const Dictionary old = *send({{protocol::kKeyRequest, protocol::kRequestMatch},
+                                {protocol::kKeyVersion, u64(protocol::kOldestVersion)}});
   EXPECT_EQ(errorOf(old), Expected(0, ""));
-  EXPECT_FALSE(old.contains("matches")) << lmo::describe(old);
-  EXPECT_EQ(errorOf(request("match", {{"rules", Array{}}})),
-            Expected(4, "invalid request format (bad rules dictionary)"));
+  EXPECT_FALSE(old.contains(protocol::kKeyMatches)) << lmo::describe(old);
+  EXPECT_EQ(errorOf(request(protocol::kRequestMatch, {{protocol::kKeyRules, Array{}}})),
+            Expected(protocol::kErrorBadRequest, "invalid request format (bad rules dictionary)"));
 }
 
 TEST_F(Discovery, HoldsAndExclusionsHide) {
   const Ids widget{kWidget}, share{kShare}, both{kWidget, kShare};
   const Dictionary held =
-      request("lock", {{"flags", u64(2)}, {"paths", Array{plugInPath("widget")}}});
-  ASSERT_NE(held.get("uuids").getIfUuid(), nullptr) << lmo::describe(held);
+      request(protocol::kRequestLock, {{protocol::kKeyFlags, u64(protocol::HoldFlags::kPlugIn)},
+                                       {protocol::kKeyPaths, Array{plugInPath("widget")}}});
+  ASSERT_NE(held.get(protocol::kKeyUuids).getIfUuid(), nullptr) << lmo::describe(held);
   EXPECT_EQ(matching({}), share);
-  request("lock", {{"uuids", Array{*held.get("uuids").getIfUuid()}}});
+  request(protocol::kRequestLock,
+          {{protocol::kKeyUuids, Array{*held.get(protocol::kKeyUuids).getIfUuid()}}});
   EXPECT_EQ(matching({}), both);
 
   // Another process replaces the preferences file; entries that are not
@@ -152,9 +157,9 @@ TEST_F(Discovery, DedicatedPlugInsReachOnlyTheirOwnApplication) {
   // This test process has no bundle at all.
   EXPECT_EQ(matching({{"QXExtensionIdentifier", "com.ded"}}), Ids{});
   std::string answer;
-  auto own = ask(owner + "/peer", "match", 0, {}, &answer);
+  auto own = ask(owner + "/peer", protocol::kRequestMatch, 0, {}, &answer);
   EXPECT_NE(answer.find("com.ded"), std::string::npos) << answer;
-  auto other = ask(stranger, "match", 0, {}, &answer);
+  auto other = ask(stranger, protocol::kRequestMatch, 0, {}, &answer);
   EXPECT_TRUE(answer.starts_with("ok ")) << answer;
   EXPECT_EQ(answer.find("com.ded"), std::string::npos) << answer;
 }
@@ -163,19 +168,20 @@ TEST_F(Discovery, DuplicatesResolvedByVersion) {
   addPlugIn("Old", "com.d", {{"QXExtensionVersion", "1.9"}});
   addPlugIn("New", "com.d", {{"QXExtensionVersion", "1.10"}});
   addPlugIn("Copy", "com.d", {{"QXExtensionVersion", "1.10"}});
-  const std::pair<uint64_t, Ids> cases[] = {
-      {0x0, {"1.10"}},
-      {0x4, {"1.10"}},  // duplicates alone change nothing
-      {0x1, {"1.9", "1.10"}},
-      {0x1 | 0x4, {"1.9", "1.10", "1.10"}},
+  const std::pair<DiscoveryFlags, Ids> cases[] = {
+      {DiscoveryFlags::kNone, {"1.10"}},
+      {DiscoveryFlags::kDuplicates, {"1.10"}},  // duplicates alone change nothing
+      {DiscoveryFlags::kVersions, {"1.9", "1.10"}},
+      {DiscoveryFlags::kVersions | DiscoveryFlags::kDuplicates, {"1.9", "1.10", "1.10"}},
   };
   for (const auto& [flags, versions] : cases) {
     Ids found;
-    for (const Value& form : matches(
-             {{"rules", Dictionary{{"QXExtensionIdentifier", "com.d"}}}, {"flags", u64(flags)}})) {
-      found.insert(*form.getIfDictionary()->get("version").getIfString());
+    for (const Value& form :
+         matches({{protocol::kKeyRules, Dictionary{{"QXExtensionIdentifier", "com.d"}}},
+                  {protocol::kKeyFlags, u64(flags)}})) {
+      found.insert(*form.getIfDictionary()->get(protocol::kFormVersion).getIfString());
     }
-    EXPECT_EQ(found, versions) << flags;
+    EXPECT_EQ(found, versions) << protocol::bits(flags);
   }
 }
 
@@ -203,12 +209,13 @@ TEST_F(Discovery, DuplicatesResolvedByTimeAndSystemResidence) {
   addPlugIn("A", "com.s");  // newer, visited after the system one
 
   const auto pathOf = [](const Value& form) {
-    return *form.getIfDictionary()->get("path").getIfString();
+    return *form.getIfDictionary()->get(protocol::kFormPath).getIfString();
   };
-  const auto reported = [&](const char* identifier, uint64_t flags) {
+  const auto reported = [&](const char* identifier, DiscoveryFlags flags) {
     std::vector<std::string> paths;
-    for (const Value& form : matches({{"rules", Dictionary{{"QXExtensionIdentifier", identifier}}},
-                                      {"flags", u64(flags)}})) {
+    for (const Value& form :
+         matches({{protocol::kKeyRules, Dictionary{{"QXExtensionIdentifier", identifier}}},
+                  {protocol::kKeyFlags, u64(flags)}})) {
       paths.push_back(pathOf(form));
     }
     return paths;
@@ -217,29 +224,31 @@ TEST_F(Discovery, DuplicatesResolvedByTimeAndSystemResidence) {
   const auto winner = [&](const Value& first, const Value& second) {
     const Dictionary &e = *first.getIfDictionary(), &p = *second.getIfDictionary();
     const Value yes = Value::boolean(true);
-    const bool systemSecond = p.get("systemResident") == yes && e.get("systemResident") != yes;
-    return pathOf(systemSecond || p.get("lastmodified").integerValue() >
-                                      e.get("lastmodified").integerValue()
+    const bool systemSecond =
+        p.get(protocol::kFormSystemResident) == yes && e.get(protocol::kFormSystemResident) != yes;
+    return pathOf(systemSecond || p.get(protocol::kFormLastModified).integerValue() >
+                                      e.get(protocol::kFormLastModified).integerValue()
                       ? second
                       : first);
   };
   for (const char* id : {"com.s", "com.q", "com.r", "com.t", "com.eq"}) {
-    const Array both =
-        matches({{"rules", Dictionary{{"QXExtensionIdentifier", id}}}, {"flags", u64(0x1 | 0x4)}});
+    const Array both = matches(
+        {{protocol::kKeyRules, Dictionary{{"QXExtensionIdentifier", id}}},
+         {protocol::kKeyFlags, u64(DiscoveryFlags::kVersions | DiscoveryFlags::kDuplicates)}});
     ASSERT_EQ(both.size(), 2u) << id;
     const std::vector<std::string> expected{winner(both[0], both[1])};
-    EXPECT_EQ(reported(id, 0x0), expected) << id;
-    EXPECT_EQ(reported(id, 0x1), expected) << id;
+    EXPECT_EQ(reported(id, DiscoveryFlags::kNone), expected) << id;
+    EXPECT_EQ(reported(id, DiscoveryFlags::kVersions), expected) << id;
   }
-  EXPECT_EQ(reported("com.t", 0x0), std::vector<std::string>{newerT});
+  EXPECT_EQ(reported("com.t", DiscoveryFlags::kNone), std::vector<std::string>{newerT});
 
   // Only the system plug-ins are left when the client asks for system ones.
-  const Array system = matches({{"flags", u64(0x8)}});
+  const Array system = matches({{protocol::kKeyFlags, u64(DiscoveryFlags::kSystemOnly)}});
   ASSERT_EQ(system.size(), 3u);
   for (const Value& form : system) {
-    EXPECT_EQ(form.getIfDictionary()->get("systemResident"), Value::boolean(true));
+    EXPECT_EQ(form.getIfDictionary()->get(protocol::kFormSystemResident), Value::boolean(true));
   }
-  EXPECT_EQ(formOf(system, "com.s").get("path"), Value(systemS));
+  EXPECT_EQ(formOf(system, "com.s").get(protocol::kFormPath), Value(systemS));
 }
 
 TEST_F(Discovery, ReplacementMarks) {
@@ -249,26 +258,31 @@ TEST_F(Discovery, ReplacementMarks) {
   EXPECT_EQ(matching({{"ENTITLEMENT:com.x.flag", Value::boolean(true)}}), Ids{"com.rep"});
   const Array forms = matches({});
   ASSERT_EQ(forms.size(), 3u);
-  EXPECT_EQ(formOf(forms, kWidget).get("overrider"), Value(uuidAt(path).string()));
-  EXPECT_EQ(formOf(forms, "com.rep").get("overriding"), Value(kWidget));
-  EXPECT_FALSE(formOf(forms, kShare).contains("overrider"));
-  EXPECT_FALSE(formOf(forms, kShare).contains("overriding"));
+  EXPECT_EQ(formOf(forms, kWidget).get(protocol::kKeyOverrider), Value(uuidAt(path).string()));
+  EXPECT_EQ(formOf(forms, "com.rep").get(protocol::kKeyOverriding), Value(kWidget));
+  EXPECT_FALSE(formOf(forms, kShare).contains(protocol::kKeyOverrider));
+  EXPECT_FALSE(formOf(forms, kShare).contains(protocol::kKeyOverriding));
 }
 
 TEST_F(Discovery, DiscoverAllNeedsAnUnsandboxedManager) {
-  request("lock", {{"flags", u64(2)}, {"paths", Array{plugInPath("widget")}}});
-  const std::string refused = "error 11 unauthorized discovery flag (VTDiscoverAll)";
-  EXPECT_EQ(errorOf(request("match", {{"flags", u64(kDiscoverAll)}})),
-            Expected(11, "unauthorized discovery flag (VTDiscoverAll)"));
-  const std::string manager = peerWith("Manager", {{kManager, Value::boolean(true)}});
+  request(protocol::kRequestLock, {{protocol::kKeyFlags, u64(protocol::HoldFlags::kPlugIn)},
+                                   {protocol::kKeyPaths, Array{plugInPath("widget")}}});
+  const Expected refused(protocol::kErrorAccessDenied,
+                         "unauthorized discovery flag (VTDiscoverAll)");
+  EXPECT_EQ(
+      errorOf(request(protocol::kRequestMatch, {{protocol::kKeyFlags, u64(DiscoveryFlags::kAll)}})),
+      refused);
+  const std::string manager =
+      peerWith("Manager", {{std::string(protocol::kManagerEntitlement), Value::boolean(true)}});
+  const uint64_t all = protocol::bits(DiscoveryFlags::kAll);
   std::string answer;
-  auto plain = ask(manager, "match", 0, {}, &answer);
+  auto plain = ask(manager, protocol::kRequestMatch, 0, {}, &answer);
   EXPECT_EQ(answer, "ok 1 com.x.share");
-  auto all = ask(manager, "match", kDiscoverAll, {}, &answer);
+  auto unfiltered = ask(manager, protocol::kRequestMatch, all, {}, &answer);
   EXPECT_TRUE(answer.starts_with("ok 2 ") && answer.find(kWidget) != std::string::npos) << answer;
   if (::access("/usr/bin/setpriv", X_OK) != 0) GTEST_SKIP() << "no setpriv to sandbox a peer";
-  auto sandboxed = ask(manager, "match", kDiscoverAll, {}, &answer, true);
-  EXPECT_EQ(answer, refused);
+  auto sandboxed = ask(manager, protocol::kRequestMatch, all, {}, &answer, true);
+  EXPECT_EQ(answer, peerError(refused.first, refused.second));
 }
 
 TEST_F(Discovery, AuthorisationReasons) {
@@ -276,9 +290,10 @@ TEST_F(Discovery, AuthorisationReasons) {
       addPlugIn("Guard", "com.g.guarded", {}, {{"QXExtensionHostEntitlement", "com.x.may-host"}});
   const base::Uuid guardedUuid = uuidAt(guarded);
   const std::string denied = "access to plugin ";
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{guardedUuid}}})),
-            Expected(11, denied + "com.g.guarded denied: the host does not have the "
-                                  "\"com.x.may-host\" entitlement"));
+  EXPECT_EQ(errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{guardedUuid}}})),
+            Expected(protocol::kErrorAccessDenied,
+                     denied + "com.g.guarded denied: the host does not have the "
+                              "\"com.x.may-host\" entitlement"));
 
   struct Case {
     Dictionary entitlements;
@@ -289,18 +304,20 @@ TEST_F(Discovery, AuthorisationReasons) {
       {{{"com.x.may-host", Value::boolean(true)}}, guardedUuid, "ok"},
       {{{kAllowedPlugIns, Array{}}},
        uuidOf("widget"),
-       "error 11 " + denied + "com.x.widget denied: invalid host restriction entitlement"},
+       peerError(protocol::kErrorAccessDenied,
+                 denied + "com.x.widget denied: invalid host restriction entitlement")},
       {{{kAllowedPlugIns, Dictionary{{"QXExtensionIdentifier", kShare}}}},
        uuidOf("widget"),
-       "error 11 " + denied +
-           "com.x.widget denied: the host's plug-in entitlement does not allow this plug-in"},
+       peerError(protocol::kErrorAccessDenied,
+                 denied + "com.x.widget denied: the host's plug-in entitlement does not allow "
+                          "this plug-in")},
       {{{kAllowedPlugIns, Dictionary{{"QXExtensionIdentifier", kShare}}}}, uuidOf("share"), "ok"},
   };
   int n = 0;
   for (const Case& c : cases) {
     std::string answer;
-    auto peer = ask(peerWith("Host" + std::to_string(n++), c.entitlements), "ready", 0, {c.plugIn},
-                    &answer);
+    auto peer = ask(peerWith("Host" + std::to_string(n++), c.entitlements), protocol::kRequestReady,
+                    0, {c.plugIn}, &answer);
     EXPECT_EQ(answer, c.answer) << lmo::describe(Value(c.entitlements));
   }
 
@@ -310,13 +327,17 @@ TEST_F(Discovery, AuthorisationReasons) {
                   Value(Dictionary{{"rating", Dictionary{{"rank", Value::integer(600)}}}}), 0644)
                   .has_value());
   const std::pair<std::optional<int64_t>, Expected> ratings[] = {
-      {300, {11, denied + "com.x.widget denied: the containing Application is age restricted"}},
+      {300,
+       {protocol::kErrorAccessDenied,
+        denied + "com.x.widget denied: the containing Application is age restricted"}},
       {600, {0, ""}},
       {std::nullopt, {0, ""}},
   };
   for (const auto& [maximum, expected] : ratings) {
     ASSERT_TRUE(platform::setMaximumApplicationRating(maximum).has_value());
-    EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("widget")}}})), expected)
+    EXPECT_EQ(
+        errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{uuidOf("widget")}}})),
+        expected)
         << maximum.value_or(-1);
   }
 }

@@ -79,13 +79,17 @@ TEST_F(Enabling, ReadyEnablesOnlyWhenEveryPlugInPasses) {
   const std::string share = launchFile(self, kShare);
   std::error_code ignored;
   std::filesystem::remove(share, ignored);  // left by an earlier test of this process
-  request("lock", {{"flags", u64(2)}, {"paths", Array{plugInPath("widget")}}});
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("share"), uuidOf("widget")}}})),
-            Expected(11, "access to plugin com.x.widget denied: the plug-in is on hold"));
+  request(protocol::kRequestLock, {{protocol::kKeyFlags, u64(protocol::HoldFlags::kPlugIn)},
+                                   {protocol::kKeyPaths, Array{plugInPath("widget")}}});
+  EXPECT_EQ(errorOf(request(protocol::kRequestReady,
+                            {{protocol::kKeyUuids, Array{uuidOf("share"), uuidOf("widget")}}})),
+            Expected(protocol::kErrorAccessDenied,
+                     "access to plugin com.x.widget denied: the plug-in is on hold"));
   EXPECT_FALSE(std::filesystem::exists(share));
 
   // The same plug-in twice is checked twice and enabled once.
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidOf("share"), uuidOf("share")}}})),
+  EXPECT_EQ(errorOf(request(protocol::kRequestReady,
+                            {{protocol::kKeyUuids, Array{uuidOf("share"), uuidOf("share")}}})),
             Expected(0, ""));
   const std::string enabling = base::format("enabling pid=%d for plug-in com.x.share(", self);
   const std::vector<std::string> lines = log.lines();
@@ -101,7 +105,8 @@ TEST_F(Enabling, ReadyEnablesOnlyWhenEveryPlugInPasses) {
   // The bundle's own environment wins over the data container.
   const Dictionary service{{"EnvironmentVariables", Dictionary{{"HOME", "/own"}}}};
   const std::string own = addPlugIn("Own", "com.o.own", {}, {}, {}, {{"LMOService", service}});
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(own)}}})), Expected(0, ""));
+  EXPECT_EQ(errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{uuidAt(own)}}})),
+            Expected(0, ""));
   auto file = platform::readPropertyListFile(launchFile(self, "com.o.own"));
   ASSERT_TRUE(file.has_value()) << file.error().description();
   auto description = platform::decodeLaunchDescription(file.value());
@@ -110,14 +115,15 @@ TEST_F(Enabling, ReadyEnablesOnlyWhenEveryPlugInPasses) {
   EXPECT_NE(std::find(environment.begin(), environment.end(), "HOME=/own"), environment.end());
 
   const std::string bare = addPlugIn("Bare", "com.n.bare", {}, {}, {}, {}, false);
-  EXPECT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(bare)}}})),
-            Expected(4, "cannot obtain executable path for plug-in com.n.bare(" +
-                            uuidAt(bare).string() + ")"));
+  EXPECT_EQ(
+      errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{uuidAt(bare)}}})),
+      Expected(protocol::kErrorBadRequest, "cannot obtain executable path for plug-in com.n.bare(" +
+                                               uuidAt(bare).string() + ")"));
 }
 
 TEST_F(Enabling, LaunchDescriptionLastsAsLongAsTheHost) {
   std::string answer;
-  auto host = ask(peerWith("Host", {}), "ready", 0, {uuidOf("widget")}, &answer);
+  auto host = ask(peerWith("Host", {}), protocol::kRequestReady, 0, {uuidOf("widget")}, &answer);
   ASSERT_EQ(answer, "ok");
   const std::string file = launchFile(host->pid(), kWidget);
   auto value = platform::readPropertyListFile(file);
@@ -137,12 +143,13 @@ TEST_F(Enabling, LaunchDescriptionLastsAsLongAsTheHost) {
 }
 
 TEST_F(Enabling, AccessGivesATokenPerPlugIn) {
-  const Dictionary empty = request("access", {{"uuids", Array{}}});
-  EXPECT_EQ(empty.get("extensions"), Value(Array{})) << lmo::describe(empty);
+  const Dictionary empty = request(protocol::kRequestAccess, {{protocol::kKeyUuids, Array{}}});
+  EXPECT_EQ(empty.get(protocol::kKeyExtensions), Value(Array{})) << lmo::describe(empty);
 
   const Value widget = uuidOf("widget"), share = uuidOf("share");
-  const Dictionary reply = request("access", {{"uuids", Array{share, widget}}});
-  const Array* tokens = reply.get("extensions").getIfArray();
+  const Dictionary reply =
+      request(protocol::kRequestAccess, {{protocol::kKeyUuids, Array{share, widget}}});
+  const Array* tokens = reply.get(protocol::kKeyExtensions).getIfArray();
   ASSERT_TRUE(tokens != nullptr && tokens->size() == 2) << lmo::describe(reply);
   const std::string shareToken = *(*tokens)[0].getIfString();
   // "1;<nonce>;<mac>;<path>": the path pointed at another bundle, and one
@@ -163,10 +170,11 @@ TEST_F(Enabling, AccessGivesATokenPerPlugIn) {
   }
 
   std::filesystem::remove_all(plugInPath("share"));
-  const Dictionary failed = request("access", {{"uuids", Array{widget, share}}});
-  EXPECT_EQ(errorOf(failed),
-            Expected(4, "cannot create extension to " + plugInPath("share") + ": 2"));
-  EXPECT_FALSE(failed.contains("extensions"));
+  const Dictionary failed =
+      request(protocol::kRequestAccess, {{protocol::kKeyUuids, Array{widget, share}}});
+  EXPECT_EQ(errorOf(failed), Expected(protocol::kErrorBadRequest,
+                                      "cannot create extension to " + plugInPath("share") + ": 2"));
+  EXPECT_FALSE(failed.contains(protocol::kKeyExtensions));
 }
 
 TEST_F(Enabling, ReadyLetsTheHostLaunchThePlugInAsDescribed) {
@@ -183,7 +191,9 @@ TEST_F(Enabling, ReadyLetsTheHostLaunchThePlugInAsDescribed) {
   addPlugIn("Env", kIdle, {}, {}, {}, executable, false);
   {
     const ScopedEnvironment sdk("VTTEST_SDK", "sdk-under-test");
-    ASSERT_EQ(errorOf(request("ready", {{"uuids", Array{uuidAt(reporter)}}})), Expected(0, ""));
+    ASSERT_EQ(
+        errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{uuidAt(reporter)}}})),
+        Expected(0, ""));
   }
 
   // This process is the host: its launcher looks where the daemon's service
@@ -215,7 +225,8 @@ TEST_F(Enabling, ReadyLetsTheHostLaunchThePlugInAsDescribed) {
 
 TEST_F(Enabling, ReadyChoosesTheSandboxProfileByExtensionPoint) {
   const auto profileAfterReady = [&](const std::string& path, const std::string& identifier) {
-    const Expected readied = errorOf(request("ready", {{"uuids", Array{uuidAt(path)}}}));
+    const Expected readied =
+        errorOf(request(protocol::kRequestReady, {{protocol::kKeyUuids, Array{uuidAt(path)}}}));
     if (readied != Expected(0, "")) return readied.second;
     auto file = platform::readPropertyListFile(launchFile(::getpid(), identifier));
     if (!file.has_value()) return file.error().description();

@@ -21,23 +21,27 @@ namespace {
 using lmo::Array;
 using lmo::Dictionary;
 using lmo::Value;
+using protocol::HoldFlags;
 using vantrel::testing::PeerProcess;
 
 uint64_t announcements() {
-  return platform::notificationCount(registry::kAnnotationChangeNotification);
+  return platform::notificationCount(protocol::kAnnotationChangeNotification);
 }
 
 class Holds : public DaemonTest {
  protected:
   // A "lock" request that takes a hold (paths null: none given).
-  Dictionary take(uint64_t flags, const Value& paths,
+  Dictionary take(HoldFlags flags, const Value& paths,
                   const std::shared_ptr<lmo::Connection>& connection = nullptr) {
-    return request("lock", Dictionary{{"flags", u64(flags)}}.setting("paths", paths), connection);
+    return request(
+        protocol::kRequestLock,
+        Dictionary{{protocol::kKeyFlags, u64(flags)}}.setting(protocol::kKeyPaths, paths),
+        connection);
   }
   // The token of the hold reply grants, as log lines write it; fails the test
   // when the hold was refused.
   static std::string granted(const Dictionary& reply) {
-    const base::Uuid* uuid = reply.get("uuids").getIfUuid();
+    const base::Uuid* uuid = reply.get(protocol::kKeyUuids).getIfUuid();
     EXPECT_NE(uuid, nullptr) << lmo::describe(reply);
     return uuid ? uuid->string() : "(refused)";
   }
@@ -46,13 +50,18 @@ class Holds : public DaemonTest {
 TEST_F(Holds, RefusedRequestsLeaveNoHold) {
   const std::string notAPlugIn = tmp_.file("apps");
   const std::pair<Dictionary, Expected> cases[] = {
-      {take(2, Value()), {4, "invalid request format"}},
-      {take(2, Array{"relative"}), {9, "absolute path required: relative"}},
-      {take(2, Array{"/nonexistent"}), {9, "invalid path: /nonexistent"}},
-      {take(2, Array{notAPlugIn}), {9, "no plug-in at path:" + notAPlugIn}},
-      {take(7, Array{plugInPath("widget")}),
-       {4, "invalid request format (unsupported hold flags)"}},
-      {take(2, Array{plugInPath("widget"), "/nonexistent"}), {9, "invalid path: /nonexistent"}},
+      {take(HoldFlags::kPlugIn, Value()), {protocol::kErrorBadRequest, "invalid request format"}},
+      {take(HoldFlags::kPlugIn, Array{"relative"}),
+       {protocol::kErrorBadPath, "absolute path required: relative"}},
+      {take(HoldFlags::kPlugIn, Array{"/nonexistent"}),
+       {protocol::kErrorBadPath, "invalid path: /nonexistent"}},
+      {take(HoldFlags::kPlugIn, Array{notAPlugIn}),
+       {protocol::kErrorBadPath, "no plug-in at path:" + notAPlugIn}},
+      // A bit beyond kApplication and kPlugIn.
+      {take(static_cast<HoldFlags>(7), Array{plugInPath("widget")}),
+       {protocol::kErrorBadRequest, "invalid request format (unsupported hold flags)"}},
+      {take(HoldFlags::kPlugIn, Array{plugInPath("widget"), "/nonexistent"}),
+       {protocol::kErrorBadPath, "invalid path: /nonexistent"}},
   };
   for (const auto& [reply, expected] : cases) EXPECT_EQ(errorOf(reply), expected);
   EXPECT_TRUE(server_->holds().empty());
@@ -62,7 +71,8 @@ TEST_F(Holds, RefusedRequestsLeaveNoHold) {
 TEST_F(Holds, TakenAndReleasedByTokenFromAnyClient) {
   base::LogCapture log;
   // Duplicate paths name the plug-in once.
-  const Dictionary taken = take(2, Array{plugInPath("widget"), plugInPath("widget")});
+  const Dictionary taken =
+      take(HoldFlags::kPlugIn, Array{plugInPath("widget"), plugInPath("widget")});
   const std::string released = "releasing plug-in hold " + granted(taken) + " at client's request";
   ASSERT_EQ(server_->holds().size(), 1u);
   EXPECT_EQ(server_->holds().front()->blocked().size(), 1u);
@@ -71,16 +81,20 @@ TEST_F(Holds, TakenAndReleasedByTokenFromAnyClient) {
   EXPECT_EQ(announcements(), 1u);
 
   // An empty take succeeds whatever the flags, and blocks nothing.
-  granted(take(9, Array{}));
+  granted(take(static_cast<HoldFlags>(9), Array{}));
   EXPECT_EQ(server_->holds().size(), 2u);
 
   // Release from another connection; elements that are not UUIDs are ignored.
-  EXPECT_TRUE(request("lock", {{"uuids", Array{"junk", taken.get("uuids")}}}).empty());
+  EXPECT_TRUE(request(protocol::kRequestLock,
+                      {{protocol::kKeyUuids, Array{"junk", taken.get(protocol::kKeyUuids)}}})
+                  .empty());
   EXPECT_FALSE(server_->holdOnPlugIn(*plugIn("widget")));
   EXPECT_EQ(log.count(released), 1u);
   EXPECT_EQ(announcements(), 3u);
   // Released already: success, nothing logged, nothing announced.
-  EXPECT_TRUE(request("lock", {{"uuids", Array{taken.get("uuids")}}}).empty());
+  EXPECT_TRUE(request(protocol::kRequestLock,
+                      {{protocol::kKeyUuids, Array{taken.get(protocol::kKeyUuids)}}})
+                  .empty());
   EXPECT_EQ(log.count(released), 1u);
   EXPECT_EQ(announcements(), 3u);
   EXPECT_EQ(server_->holds().size(), 1u);
@@ -93,26 +107,27 @@ TEST_F(Holds, RunningPlugInsMakeAnApplicationHoldBusy) {
   ASSERT_EQ(widget->readLine(), "ready");
   ASSERT_EQ(share->readLine(), "ready");
 
-  const Dictionary refused = take(1, Array{hostApp()});
-  EXPECT_EQ(errorOf(refused), Expected(14, "plug-ins are busy"));
-  const Array* conflicts = refused.get("conflicts").getIfArray();
+  const Dictionary refused = take(HoldFlags::kApplication, Array{hostApp()});
+  EXPECT_EQ(errorOf(refused), Expected(protocol::kErrorBusy, "plug-ins are busy"));
+  const Array* conflicts = refused.get(protocol::kKeyConflicts).getIfArray();
   ASSERT_NE(conflicts, nullptr) << lmo::describe(refused);
   std::multiset<std::string> running;
   for (const Value& conflict : *conflicts) {
     const Dictionary* entry = conflict.getIfDictionary();
-    running.insert(lmo::describe(entry ? entry->get("ExtensionBundleIdentifier") : conflict));
+    running.insert(
+        lmo::describe(entry ? entry->get(protocol::kKeyConflictBundleIdentifier) : conflict));
   }
   EXPECT_EQ(running, (std::multiset<std::string>{kShare, kWidget}));
   EXPECT_TRUE(server_->holds().empty());
   EXPECT_EQ(announcements(), 0u);
 
   // A hold on one plug-in bundle is granted even while it runs.
-  granted(take(2, Array{plugInPath("widget")}));
+  granted(take(HoldFlags::kPlugIn, Array{plugInPath("widget")}));
 
   // Once nothing runs, the application's hold is granted over both.
   widget.reset();
   share.reset();
-  granted(take(1, Array{hostApp()}));
+  granted(take(HoldFlags::kApplication, Array{hostApp()}));
   EXPECT_EQ(server_->holds().back()->blocked().size(), 2u);
 }
 
@@ -120,9 +135,11 @@ TEST_F(Holds, ReleasedWhenTheClientGoesAwayBeforeItIsDeclaredDead) {
   server_->setVerbose(1);
   base::LogCapture log;
   auto connection = connect();
-  const std::string widget = granted(take(2, Array{plugInPath("widget")}, connection));
-  const std::string share = granted(take(2, Array{plugInPath("share")}, connection));
-  const std::string other = granted(take(2, Array{plugInPath("share")}));
+  const std::string widget =
+      granted(take(HoldFlags::kPlugIn, Array{plugInPath("widget")}, connection));
+  const std::string share =
+      granted(take(HoldFlags::kPlugIn, Array{plugInPath("share")}, connection));
+  const std::string other = granted(take(HoldFlags::kPlugIn, Array{plugInPath("share")}));
   ASSERT_EQ(server_->holds().size(), 3u);
   const uint64_t before = announcements();
 
@@ -130,10 +147,11 @@ TEST_F(Holds, ReleasedWhenTheClientGoesAwayBeforeItIsDeclaredDead) {
   // the client is dead: it must then do nothing, not even reply.
   std::promise<void> release;
   server_->submitWork([released = release.get_future().share()] { released.wait(); });
-  (void)connection->send(Dictionary{{"request", "annotate"},
-                                    {"version", u64(3)},
-                                    {"uuids", Array{uuidOf("share")}},
-                                    {"annotations", Dictionary{{"election", Value::integer(1)}}}});
+  (void)connection->send(Dictionary{
+      {protocol::kKeyRequest, protocol::kRequestAnnotate},
+      {protocol::kKeyVersion, u64(protocol::kCurrentVersion)},
+      {protocol::kKeyUuids, Array{uuidOf("share")}},
+      {protocol::kKeyAnnotations, Dictionary{{protocol::kAnnotationElection, Value::integer(1)}}}});
   connection->cancel();
   const std::string pid = std::to_string(::getpid());
   ASSERT_TRUE(eventually([&] { return log.count("client " + pid + " is dead") == 1; }));
@@ -158,8 +176,9 @@ TEST_F(Holds, ReleasedWhenTheClientGoesAwayBeforeItIsDeclaredDead) {
 
 TEST_F(Holds, ReleasedWhenTheClientProcessExits) {
   base::LogCapture log;
-  auto peer = PeerProcess::start(vantrel::testing::testPeerPath(),
-                                 {"hold", socket_, "2", plugInPath("widget")});
+  auto peer = PeerProcess::start(
+      vantrel::testing::testPeerPath(),
+      {"hold", socket_, std::to_string(protocol::bits(HoldFlags::kPlugIn)), plugInPath("widget")});
   ASSERT_NE(peer, nullptr);
   const std::string held = peer->readLine().value_or("(nothing)");
   ASSERT_TRUE(held.starts_with("held ")) << held;

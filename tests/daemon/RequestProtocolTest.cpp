@@ -20,21 +20,35 @@ using RequestProtocol = DaemonTest;
 
 TEST_F(RequestProtocol, EnvelopeIsCheckedBeforeDispatch) {
   const std::pair<Dictionary, Expected> cases[] = {
-      {{{"request", "bulk"}, {"version", u64(1)}},
-       {7, "unsupported protocol version 1 (current 3)"}},
-      {{{"request", "bulk"}, {"version", u64(4)}},
-       {7, "unsupported protocol version 4 (current 3)"}},
-      {{{"request", "bulk"}}, {7, "unsupported protocol version 0 (current 3)"}},
-      {{{"request", "bulk"}, {"version", "3"}}, {7, "unsupported protocol version 0 (current 3)"}},
-      {{{"request", "bulk"}, {"version", u64((1ull << 32) + 2)}},
-       {7, "unsupported protocol version 2 (current 3)"}},
-      {{{"version", u64(9)}}, {7, "unsupported protocol version 9 (current 3)"}},
-      {{{"version", u64(3)}}, {4, "invalid request format (missing type)"}},
-      {{{"request", u64(1)}, {"version", u64(3)}}, {4, "invalid request format (missing type)"}},
-      {{{"request", "frobnicate"}, {"version", u64(2)}}, {4, "unrecognized request"}},
-      {{{"request", "Match"}, {"version", u64(3)}}, {4, "unrecognized request"}},
-      {{{"request", "bulk"}, {"version", u64(2)}}, {0, ""}},
-      {{{"request", "bulk"}, {"version", u64(3)}, {"flags", u64(0x1F)}}, {0, ""}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk}, {protocol::kKeyVersion, u64(1)}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 1 (current 3)"}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk}, {protocol::kKeyVersion, u64(4)}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 4 (current 3)"}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 0 (current 3)"}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk}, {protocol::kKeyVersion, "3"}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 0 (current 3)"}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk},
+        {protocol::kKeyVersion, u64((1ull << 32) + 2)}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 2 (current 3)"}},
+      {{{protocol::kKeyVersion, u64(9)}},
+       {protocol::kErrorVersionMismatch, "unsupported protocol version 9 (current 3)"}},
+      {{{protocol::kKeyVersion, u64(protocol::kCurrentVersion)}},
+       {protocol::kErrorBadRequest, "invalid request format (missing type)"}},
+      {{{protocol::kKeyRequest, u64(1)}, {protocol::kKeyVersion, u64(protocol::kCurrentVersion)}},
+       {protocol::kErrorBadRequest, "invalid request format (missing type)"}},
+      {{{protocol::kKeyRequest, "frobnicate"},
+        {protocol::kKeyVersion, u64(protocol::kOldestVersion)}},
+       {protocol::kErrorBadRequest, "unrecognized request"}},
+      {{{protocol::kKeyRequest, "Match"}, {protocol::kKeyVersion, u64(protocol::kCurrentVersion)}},
+       {protocol::kErrorBadRequest, "unrecognized request"}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk},
+        {protocol::kKeyVersion, u64(protocol::kOldestVersion)}},
+       {0, ""}},
+      {{{protocol::kKeyRequest, protocol::kRequestBulk},
+        {protocol::kKeyVersion, u64(protocol::kCurrentVersion)},
+        {protocol::kKeyFlags, u64(0x1F)}},
+       {0, ""}},
   };
   auto connection = connect();
   for (const auto& [message, expected] : cases) {
@@ -58,56 +72,74 @@ TEST_F(RequestProtocol, PathsAreDecodedAndCanonicalised) {
     Expected expected;
   };
   const Case cases[] = {
-      {"add", Value(), {4, "invalid request format"}},
-      {"add", Value("/tmp"), {4, "invalid request format"}},
-      {"add", Array{u64(1)}, {4, "invalid request format"}},
-      {"add", Array{"tmp/x"}, {9, "absolute path required: tmp/x"}},
-      {"remove", Array{""}, {9, "absolute path required: "}},
-      {"add", Array{}, {0, ""}},
-      {"add", Array{"/nonexistent/x.plugin"}, {9, "invalid plugin path: /nonexistent/x.plugin"}},
+      {protocol::kRequestAdd, Value(), {protocol::kErrorBadRequest, "invalid request format"}},
+      {protocol::kRequestAdd,
+       Value("/tmp"),
+       {protocol::kErrorBadRequest, "invalid request format"}},
+      {protocol::kRequestAdd,
+       Array{u64(1)},
+       {protocol::kErrorBadRequest, "invalid request format"}},
+      {protocol::kRequestAdd,
+       Array{"tmp/x"},
+       {protocol::kErrorBadPath, "absolute path required: tmp/x"}},
+      {protocol::kRequestRemove, Array{""}, {protocol::kErrorBadPath, "absolute path required: "}},
+      {protocol::kRequestAdd, Array{}, {0, ""}},
+      {protocol::kRequestAdd,
+       Array{"/nonexistent/x.plugin"},
+       {protocol::kErrorBadPath, "invalid plugin path: /nonexistent/x.plugin"}},
       // Registered under its canonical path; the next path fails and the
       // first stays registered.
-      {"add", Array{viaLink, notABundle}, {2, "unable to register plug-in at " + notABundle}},
-      {"remove", Array{"/nonexistent/x.plugin"}, {9, "no plugin at /nonexistent/x.plugin"}},
+      {protocol::kRequestAdd,
+       Array{viaLink, notABundle},
+       {protocol::kErrorRegistryRefused, "unable to register plug-in at " + notABundle}},
+      {protocol::kRequestRemove,
+       Array{"/nonexistent/x.plugin"},
+       {protocol::kErrorBadPath, "no plugin at /nonexistent/x.plugin"}},
   };
   base::LogCapture log;
   for (const Case& c : cases) {
-    EXPECT_EQ(errorOf(request(c.type, Dictionary().setting("paths", c.paths))), c.expected)
+    EXPECT_EQ(errorOf(request(c.type, Dictionary().setting(protocol::kKeyPaths, c.paths))),
+              c.expected)
         << c.type << " " << lmo::describe(c.paths);
   }
   EXPECT_EQ(log.count("failed to register plug-in at " + notABundle), 1u);
   ASSERT_NE(registry_->plugInForUrl(loose), nullptr);
 
-  EXPECT_EQ(errorOf(request("remove", {{"paths", Array{viaLink}}})), Expected(0, ""));
+  EXPECT_EQ(errorOf(request(protocol::kRequestRemove, {{protocol::kKeyPaths, Array{viaLink}}})),
+            Expected(0, ""));
   EXPECT_EQ(registry_->plugInForUrl(loose), nullptr);
-  EXPECT_EQ(errorOf(request("remove", {{"paths", Array{loose}}})),
-            Expected(9, "no plugin at " + loose));
+  EXPECT_EQ(errorOf(request(protocol::kRequestRemove, {{protocol::kKeyPaths, Array{loose}}})),
+            Expected(protocol::kErrorBadPath, "no plugin at " + loose));
   EXPECT_EQ(log.count("bulk options 0x1f not supported"), 0u);
-  request("bulk", {{"flags", u64(0x1F)}});
+  request(protocol::kRequestBulk, {{protocol::kKeyFlags, u64(0x1F)}});
   EXPECT_EQ(log.count("bulk options 0x1f not supported"), 1u);
 }
 
 TEST_F(RequestProtocol, UninstallWithdrawsServiceRegistrations) {
   base::LogCapture log;
-  EXPECT_EQ(errorOf(request("remove", {{"paths", Array{plugInPath("widget")}}})), Expected(0, ""));
+  EXPECT_EQ(errorOf(request(protocol::kRequestRemove,
+                            {{protocol::kKeyPaths, Array{plugInPath("widget")}}})),
+            Expected(0, ""));
   EXPECT_TRUE(eventually([&] { return log.contains("PLUGIN REMOVAL:com.x.widget RESULT:"); }));
   EXPECT_EQ(server_->findPlugIn(uuidOf("share"))->identifier(), kShare);
 }
 
 TEST_F(RequestProtocol, UuidListsAreDecodedInOrder) {
-  const Dictionary change{{"election", Value::integer(1)}};
+  const Dictionary change{{protocol::kAnnotationElection, Value::integer(1)}};
   const base::Uuid widget = uuidOf("widget");
   const base::Uuid unknown = base::Uuid::random();
   const auto annotate = [&](const Value& uuids) {
-    return errorOf(
-        request("annotate", Dictionary{{"annotations", change}}.setting("uuids", uuids)));
+    return errorOf(request(
+        protocol::kRequestAnnotate,
+        Dictionary{{protocol::kKeyAnnotations, change}}.setting(protocol::kKeyUuids, uuids)));
   };
   const std::pair<Value, Expected> cases[] = {
-      {Value(), {4, "invalid request format (uuid)"}},
-      {Value(widget), {4, "invalid request format (uuid)"}},
-      {Array{"not a uuid"}, {4, "invalid request (bad uuid array)"}},
-      {Array{Value::data(widget.bytes().data(), 16)}, {4, "invalid request (bad uuid array)"}},
-      {Array{unknown}, {4, "no such plugin (uuid not found)"}},
+      {Value(), {protocol::kErrorBadRequest, "invalid request format (uuid)"}},
+      {Value(widget), {protocol::kErrorBadRequest, "invalid request format (uuid)"}},
+      {Array{"not a uuid"}, {protocol::kErrorBadRequest, "invalid request (bad uuid array)"}},
+      {Array{Value::data(widget.bytes().data(), 16)},
+       {protocol::kErrorBadRequest, "invalid request (bad uuid array)"}},
+      {Array{unknown}, {protocol::kErrorBadRequest, "no such plugin (uuid not found)"}},
       {Array{}, {0, ""}},
   };
   for (const auto& [uuids, expected] : cases) {
@@ -115,7 +147,8 @@ TEST_F(RequestProtocol, UuidListsAreDecodedInOrder) {
   }
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), std::nullopt);
   // Elements before the bad one keep their effect.
-  EXPECT_EQ(annotate(Array{widget, unknown}), Expected(4, "no such plugin (uuid not found)"));
+  EXPECT_EQ(annotate(Array{widget, unknown}),
+            Expected(protocol::kErrorBadRequest, "no such plugin (uuid not found)"));
   EXPECT_EQ(server_->annotationForPlugIn(*plugIn("widget")), change);
 }
 

@@ -45,9 +45,12 @@ TEST_F(Scope, AnotherUserMayDiscoverButNotChangeState) {
   const std::pair<const char*, std::string> cases[] = {
       {protocol::kRequestMatch, "ok 2"},
       {protocol::kRequestExplain, "ok"},
-      {protocol::kRequestAdd, std::string("error 11 request \"add") + refusedTail},
-      {protocol::kRequestRemove, std::string("error 11 request \"remove") + refusedTail},
-      {protocol::kRequestAnnotate, std::string("error 11 request \"annotate") + refusedTail},
+      {protocol::kRequestAdd,
+       peerError(protocol::kErrorAccessDenied, "request \"add" + refusedTail)},
+      {protocol::kRequestRemove,
+       peerError(protocol::kErrorAccessDenied, "request \"remove" + refusedTail)},
+      {protocol::kRequestAnnotate,
+       peerError(protocol::kErrorAccessDenied, "request \"annotate" + refusedTail)},
   };
   for (const auto& [type, expected] : cases) {
     const std::string answer = askAsOtherUser(peer, "request", {type, "0"});
@@ -56,7 +59,7 @@ TEST_F(Scope, AnotherUserMayDiscoverButNotChangeState) {
   const std::string hold = askAsOtherUser(
       peer, "hold",
       {std::to_string(protocol::bits(protocol::HoldFlags::kPlugIn)), plugInPath("widget")});
-  EXPECT_EQ(hold, std::string("error 11 request \"lock") + refusedTail);
+  EXPECT_EQ(hold, peerError(protocol::kErrorAccessDenied, "request \"lock" + refusedTail));
   EXPECT_EQ(server_->holds().size(), 0u);
 }
 

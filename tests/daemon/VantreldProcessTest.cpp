@@ -28,6 +28,7 @@
 
 #include "lmo/Cbor.h"
 #include "lmo/Frame.h"
+#include "lmo/Protocol.h"
 #include "lmo/Value.h"
 #include "tests/support/PeerProcess.h"
 #include "tests/support/TempDir.h"
@@ -123,7 +124,7 @@ Bytes nestedMaps(int depth) {
 }
 
 Dictionary request(const char* type, uint64_t version) {
-  return {{"request", type}, {"version", Value::unsignedInteger(version)}};
+  return {{protocol::kKeyRequest, type}, {protocol::kKeyVersion, Value::unsignedInteger(version)}};
 }
 
 Bytes cbor(const Dictionary& body) {
@@ -224,10 +225,12 @@ class RawClient {
 // serves this connection, and a request that logs nothing at verbosity 0.
 ::testing::AssertionResult ping(RawClient& client, uint64_t id) {
   std::optional<lmo::Frame> reply;
-  if (client.send(FrameKind::kRequest, id, request("ping", 3))) reply = client.readFrame();
+  if (client.send(FrameKind::kRequest, id, request("ping", protocol::kCurrentVersion)))
+    reply = client.readFrame();
   if (!reply) return ::testing::AssertionFailure() << "no reply to ping " << id;
   if (reply->kind != FrameKind::kReply || reply->inReplyTo != id ||
-      reply->body.get("errorcode").getIfUInt64() != 4u) {
+      reply->body.get(protocol::kKeyErrorCode).getIfUInt64() !=
+          static_cast<uint64_t>(protocol::kErrorBadRequest)) {
     return ::testing::AssertionFailure() << "ping " << id << " got reply to " << reply->inReplyTo
                                          << ": " << lmo::describe(reply->body);
   }
@@ -374,7 +377,7 @@ TEST_F(VantreldProcess, ReplacesAStaleSocketButNeverALiveOneOrAFile) {
 TEST_F(VantreldProcess, ServesWellFormedFramesAndDropsMalformedPeers) {
   Daemon daemon = startServing(socket_);
   ASSERT_TRUE(daemon.client);
-  const Bytes body = cbor(request("ping", 3));
+  const Bytes body = cbor(request("ping", protocol::kCurrentVersion));
   const Bytes valid = rawFrame({}, body);
   const uint8_t kMessage = static_cast<uint8_t>(FrameKind::kMessage);
   const uint8_t kReply = static_cast<uint8_t>(FrameKind::kReply);
@@ -382,7 +385,8 @@ TEST_F(VantreldProcess, ServesWellFormedFramesAndDropsMalformedPeers) {
   // order, so the first frame back must answer the request after them.
   const Bytes messages =
       rawFrame({.kind = kMessage, .id = 5},
-               cbor(request("annotate", 3).setting("annotations", Dictionary()))) +
+               cbor(request(protocol::kRequestAnnotate, protocol::kCurrentVersion)
+                        .setting(protocol::kKeyAnnotations, Dictionary()))) +
       rawFrame({.kind = kMessage, .id = 6}, cbor(request("ping", 1)));
   struct Case {
     const char* name;
@@ -446,7 +450,8 @@ TEST_F(VantreldProcess, SurvivesBrokenPipes) {
   for (const bool stopReading : {false, true}) {
     SCOPED_TRACE(stopReading ? "stops reading" : "closes");
     RawClient client(socket_);
-    ASSERT_TRUE(client.send(FrameKind::kRequest, ++id, request("bulk", 3)));
+    ASSERT_TRUE(client.send(FrameKind::kRequest, ++id,
+                            request(protocol::kRequestBulk, protocol::kCurrentVersion)));
     if (stopReading) {
       // The socket stays open but refuses input: the reply's write fails
       // with a broken pipe, and the daemon drops the connection.
@@ -470,7 +475,8 @@ TEST_F(VantreldProcess, SurvivesBrokenPipes) {
   Daemon unlogged = startServing(tmp_.file("unlogged.socket"), {}, fifo);
   ::close(reader);
   ASSERT_TRUE(unlogged.client);
-  ASSERT_TRUE(unlogged.client->send(FrameKind::kRequest, 2, request("bulk", 3)));
+  ASSERT_TRUE(unlogged.client->send(FrameKind::kRequest, 2,
+                                    request(protocol::kRequestBulk, protocol::kCurrentVersion)));
   EXPECT_TRUE(unlogged.client->readFrame().has_value());
   EXPECT_TRUE(ping(*unlogged.client, 3));
 }
@@ -513,7 +519,8 @@ TEST_F(VantreldProcess, VerbosityAddsDebugLinesThenDumps) {
     Daemon daemon =
         startServing(tmp_.file("verbose-" + std::to_string(++row) + ".socket"), c.flags);
     ASSERT_TRUE(daemon.client);
-    ASSERT_TRUE(daemon.client->send(FrameKind::kRequest, 7, request("bulk", 3)));
+    ASSERT_TRUE(daemon.client->send(FrameKind::kRequest, 7,
+                                    request(protocol::kRequestBulk, protocol::kCurrentVersion)));
     ASSERT_TRUE(daemon.client->readFrame().has_value());
     // The lines of a request are written before its reply is sent.
     EXPECT_EQ(logLines(daemon.log, requestLine).size(), c.debugLines) << readFile(daemon.log);

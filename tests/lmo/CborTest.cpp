@@ -8,6 +8,8 @@
 #include <string>
 #include <vector>
 
+#include "lmo/Protocol.h"
+
 namespace vantrel::lmo {
 namespace {
 
@@ -46,9 +48,9 @@ TEST(CborTest, RoundTripsEveryKindOfValue) {
       Value(std::string(300, 'x')), Value::data(Bytes{}), Value::data(Bytes{0, 1, 2, 0xFF}),
       Value(Date{1363896240.5}), Value(Date{-1.0}), Value(uuid), Value(Array{}),
       Value(Array{Value::integer(1), Value("two"), Value(Array{Value()})}),
-      Value(Dictionary{{"request", Value("match")},
-                       {"version", Value::unsignedInteger(3)},
-                       {"rules", Value(Dictionary{{"a", Value(Array{Value(uuid)})}})}}),
+      Value(Dictionary{{protocol::kKeyRequest, Value(protocol::kRequestMatch)},
+                       {protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion)},
+                       {protocol::kKeyRules, Value(Dictionary{{"a", Value(Array{Value(uuid)})}})}}),
       nested(kMaxCborDepth)};
   for (const Value& v : values) {
     Value back = decodeOk(encodeOk(v));

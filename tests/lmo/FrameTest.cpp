@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include "lmo/Protocol.h"
+
 namespace vantrel::lmo {
 namespace {
 
@@ -43,7 +45,8 @@ std::vector<Frame> drain(FrameReader& reader) {
 
 TEST(FrameTest, ReadsFramesHoweverTheBytesArrive) {
   const Frame sent[] = {
-      {FrameKind::kRequest, 1, 0, Dictionary{{"request", Value("match")}}},
+      {FrameKind::kRequest, 1, 0,
+       Dictionary{{protocol::kKeyRequest, Value(protocol::kRequestMatch)}}},
       {FrameKind::kMessage, 2, 0, Dictionary{}},
       {FrameKind::kReply, 9, 1, Dictionary{{"data", Value::data(Bytes(70000, 7))}}},
   };

@@ -6,6 +6,7 @@
 
 #include "base/Format.h"
 #include "lmo/Message.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::lmo {
 namespace {
@@ -126,17 +127,17 @@ TEST(Value, DescriptionsAreReadableOneLiners) {
 }
 
 TEST(Message, TypedReadsOfMessageDictionaries) {
-  Dictionary m{{"paths", Value(Array{})},
-               {"rules", Value(Dictionary{{"k", Value("v")}})},
+  Dictionary m{{protocol::kKeyPaths, Value(Array{})},
+               {protocol::kKeyRules, Value(Dictionary{{"k", Value("v")}})},
                {"name", Value("x")}};
-  ASSERT_TRUE(lmo_dictionary_get_array(m, "paths"));
-  EXPECT_TRUE(lmo_dictionary_get_array(m, "paths")->empty());
-  EXPECT_FALSE(lmo_dictionary_get_array(m, "rules"));
+  ASSERT_TRUE(lmo_dictionary_get_array(m, protocol::kKeyPaths));
+  EXPECT_TRUE(lmo_dictionary_get_array(m, protocol::kKeyPaths)->empty());
+  EXPECT_FALSE(lmo_dictionary_get_array(m, protocol::kKeyRules));
   EXPECT_FALSE(lmo_dictionary_get_array(m, "name"));
   EXPECT_FALSE(lmo_dictionary_get_array(m, "missing"));
   EXPECT_FALSE(lmo_dictionary_get_array(m, nullptr));
-  EXPECT_TRUE(lmo_dictionary_get_dictionary(m, "rules"));
-  EXPECT_FALSE(lmo_dictionary_get_dictionary(m, "paths"));
+  EXPECT_TRUE(lmo_dictionary_get_dictionary(m, protocol::kKeyRules));
+  EXPECT_FALSE(lmo_dictionary_get_dictionary(m, protocol::kKeyPaths));
   EXPECT_TRUE(messageFromPropertyList(Value(m)));
   EXPECT_FALSE(messageFromPropertyList(Value("not a dictionary")));
 }

@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "model/VTPlugInCore.h"
 #include "tests/model/PlugInFixtures.h"
 
@@ -22,7 +23,7 @@ TEST(PlugInForm, ExportAndRebuildRoundTrip) {
   r->setLastModified(-5);
   r->setOnSystemVolume(true);
   r->setEntitlements(Dictionary{{"e", Value::boolean(true)}});
-  r->setAnnotations(Dictionary{{"election", Value::integer(1)}});
+  r->setAnnotations(Dictionary{{protocol::kAnnotationElection, Value::integer(1)}});
   r->setContainingUrl(FileUrl::fromPath("/apps/A.app"));
   r->setLocalizedName("Name");
   r->setLocalizedShortName("Short");
@@ -126,10 +127,12 @@ TEST(PlugInForm, RebuildFailuresLog) {
 
 TEST(PlugInForm, AnnotationChanges) {
   auto r = recordAt("/a/X.plugin", bundleInfo({}));
-  r->setAnnotation("election", Value::integer(1));  // starting from no annotations
-  r->setAnnotation("extension", Value(Dictionary{{"k", "v"}}));
-  r->setAnnotation("election", Value());
-  EXPECT_EQ(r->annotations(), (Dictionary{{"extension", Dictionary{{"k", "v"}}}}));
+  r->setAnnotation(protocol::kAnnotationElection,
+                   Value::integer(1));  // starting from no annotations
+  r->setAnnotation(protocol::kAnnotationExtension, Value(Dictionary{{"k", "v"}}));
+  r->setAnnotation(protocol::kAnnotationElection, Value());
+  EXPECT_EQ(r->annotations(),
+            (Dictionary{{protocol::kAnnotationExtension, Dictionary{{"k", "v"}}}}));
   r->updateFromForm(Dictionary{{"annotations", Dictionary{{"a", "b"}}}, {"identifier", "new"}});
   EXPECT_EQ(r->annotations(), (Dictionary{{"a", "b"}}));
   EXPECT_EQ(r->identifier(), "p");

@@ -4,6 +4,7 @@
 #include <filesystem>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "platform/PropertyList.h"
 #include "tests/omnidex/OmnidexFixtures.h"
 
@@ -130,7 +131,7 @@ TEST(OmnidexMetadata, EntitlementsThatBecomeUntrustedAreDroppedAtTheNextReconcil
   RegistryTree tree;
   const std::string path = writeBundle(tree.plugIns() + "/E.plugin", plugInInfo("e", "p"));
   const std::string file = path + "/Entitlements.plist";
-  const Dictionary granted{{"com.karvo.private.vantrel.manager", Value::boolean(true)}};
+  const Dictionary granted{{std::string(protocol::kManagerEntitlement), Value::boolean(true)}};
   ASSERT_TRUE(platform::writePropertyListFile(file, Value(granted), 0644).has_value());
   auto registry = tree.open();
   auto observer = observe(*registry);

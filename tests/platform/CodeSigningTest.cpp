@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <string>
 
+#include "lmo/Protocol.h"
 #include "platform/PropertyList.h"
 #include "tests/platform/Helpers.h"
 
@@ -20,7 +21,7 @@ using lmo::Dictionary;
 using lmo::Value;
 
 const Dictionary kGranted{
-    {"com.karvo.private.vantrel.manager", Value::boolean(true)},
+    {std::string(protocol::kManagerEntitlement), Value::boolean(true)},
     {"com.karvo.developer.vantrel.allowedplugins",
      Value(Dictionary{{"QXExtensionPointIdentifier", Value("com.example.point")}})},
 };
@@ -96,7 +97,7 @@ TEST(CodeSigning, EntitlementsComeOnlyFromATrustedFileThatBelongsToTheExecutable
     EXPECT_EQ(t.entitlements(), c.granted ? kGranted : Dictionary());
 
     const CodeSigningTask::Entitlement manager =
-        t.copyValueForEntitlement("com.karvo.private.vantrel.manager");
+        t.copyValueForEntitlement(protocol::kManagerEntitlement);
     EXPECT_EQ(manager.value, c.granted ? Value::boolean(true) : Value());
     if (c.problem == nullptr) {
       EXPECT_FALSE(manager.error.has_value()) << manager.error->description();

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <set>
 
+#include "lmo/Protocol.h"
 #include "omnidex/Workspace.h"
 #include "registry/VTDatabase.h"
 #include "tests/support/ScopedEnvironment.h"
@@ -37,7 +38,7 @@ inline std::shared_ptr<omnidex::PlugInRecord> record(const std::string& identifi
 }
 
 inline lmo::Dictionary election(int64_t e) {
-  return {{"election", lmo::Value::integer(e)}};
+  return {{protocol::kAnnotationElection, lmo::Value::integer(e)}};
 }
 
 // The identifiers of a lookup's records, duplicates kept.

@@ -57,9 +57,9 @@ TEST_F(VTDAnnotationStoreTest, MergeRemoveSharedKeysAndFailedSave) {
   auto store = VTDAnnotationStore::initWithDatabase(file());
   const Dictionary extension{{"client", "data"}};
   store->setAnnotation(election(1).setting("other", "o"), *a_);
-  store->setAnnotation(election(2).setting("extension", extension), *a_);
+  store->setAnnotation(election(2).setting(protocol::kAnnotationExtension, extension), *a_);
   EXPECT_EQ(store->annotationForPlugIn(*a_),
-            election(2).setting("extension", extension).setting("other", "o"));
+            election(2).setting(protocol::kAnnotationExtension, extension).setting("other", "o"));
   store->setAnnotation(std::nullopt, *a_);
   EXPECT_EQ(store->annotationForPlugIn(*a_), std::nullopt);
 

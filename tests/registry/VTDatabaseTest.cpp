@@ -5,6 +5,7 @@
 #include <thread>
 
 #include "base/Log.h"
+#include "lmo/Protocol.h"
 #include "platform/NotificationCenter.h"
 #include "tests/registry/RegistryFixtures.h"
 
@@ -194,8 +195,6 @@ TEST_F(Discovery, RecordsThatAreNotOffered) {
 
 // ---- Elections: annotation changes through the database ----
 
-constexpr const char* kChange = "com.karvo.vantrel.annotation-change";
-
 using Elections = testing::RegistryTest;
 
 TEST_F(Elections, EverySetPostsOneNotification) {
@@ -208,19 +207,19 @@ TEST_F(Elections, EverySetPostsOneNotification) {
   for (auto& [target, annotation] :
        {std::pair{db, std::optional(election(1))}, {db, std::nullopt}, {unsaved, election(1)}}) {
     EXPECT_EQ(target->setAnnotation(annotation, *p), std::nullopt);
-    EXPECT_EQ(platform::notificationCount(kChange), ++expected);
+    EXPECT_EQ(platform::notificationCount(protocol::kAnnotationChangeNotification), ++expected);
     EXPECT_EQ(target->annotationForPlugIn(*p), annotation);
   }
 }
 
 TEST_F(Elections, AutoElectionWhenTheRecordIsBuilt) {
-  const Dictionary extension{{"extension", Dictionary{{"x", "y"}}}};
+  const Dictionary extension{{protocol::kAnnotationExtension, Dictionary{{"x", "y"}}}};
   const Value yes = Value::boolean(true), no = Value::integer(0);
   const std::tuple<Value, std::optional<Dictionary>, std::optional<Dictionary>> cases[] = {
       {yes, std::nullopt, election(1)},
       {yes, election(0), election(1)},
       {yes, election(2), election(2)},
-      {yes, extension, extension.setting("election", Value::integer(1))},
+      {yes, extension, extension.setting(protocol::kAnnotationElection, Value::integer(1))},
       {no, std::nullopt, std::nullopt}};
   for (const auto& [entitlement, before, after] : cases) {
     auto r = record("com.x.auto", {{kAutoElect, entitlement}});
@@ -230,10 +229,11 @@ TEST_F(Elections, AutoElectionWhenTheRecordIsBuilt) {
       db->annotations()->setAnnotations(a ? Dictionary{{"com.x.auto", *a}} : Dictionary{});
     };
     stored(before);
-    const uint64_t posted = platform::notificationCount(kChange);
+    const uint64_t posted = platform::notificationCount(protocol::kAnnotationChangeNotification);
     auto p = db->findPlugIn(r->uuid);
     EXPECT_EQ(db->annotationForPlugIn(*p), after);
-    EXPECT_EQ(platform::notificationCount(kChange), posted);  // auto-election posts nothing
+    EXPECT_EQ(platform::notificationCount(protocol::kAnnotationChangeNotification),
+              posted);  // auto-election posts nothing
     if (!after) continue;
 
     // Set back to 0, it is elected again when the record is rebuilt.

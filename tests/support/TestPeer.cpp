@@ -18,7 +18,7 @@
 //              when refused, then blocks until standard input closes (the
 //              hold lasts as long as the connection); exit 0.
 //   request <service> <type> <flags> [<uuid>...]
-//              sends {"request": type, "version": 3, "flags": flags,
+//              sends {"request": type, "version": <current>, "flags": flags,
 //              "uuids": [<uuid>...]} and writes the answer as one line:
 //              "ok", followed for a reply with "matches" by " <count>
 //              <identifier>,<identifier>..." in reply order, or
@@ -55,11 +55,13 @@
 
 #include "base/Log.h"
 #include "client/VTDaemonClient.h"
+#include "lmo/Protocol.h"
 #include "platform/SandboxExtensionService.h"
 
 namespace {
 
 using vantrel::client::VTDaemonClient;
+namespace protocol = vantrel::protocol;
 
 constexpr int kConnectionFailedExit = 1;
 constexpr int kUsageExit = 2;
@@ -109,7 +111,8 @@ std::optional<vantrel::base::Error> transportFailure(
 
 int connectAndWait(const char* service) {
   auto client = VTDaemonClient::initWithServiceName(service);
-  auto message = client->request("annotate").setting("annotations", vantrel::lmo::Dictionary());
+  auto message = client->request(protocol::kRequestAnnotate)
+                     .setting(protocol::kKeyAnnotations, vantrel::lmo::Dictionary());
   if (auto failure = transportFailure(client->sendSync(message, kReplyTimeout))) {
     printError(*failure);
     return kConnectionFailedExit;
@@ -122,7 +125,8 @@ int holdAndWait(const char* service, uint64_t flags, std::vector<std::string> pa
   auto client = VTDaemonClient::initWithServiceName(service);
   auto outcome = client->sendSyncWith(
       [&](VTDaemonClient::ReplyHandler reply) {
-        return client->holdPlugins(paths, flags, std::move(reply));
+        return client->holdPlugins(paths, static_cast<protocol::HoldFlags>(flags),
+                                   std::move(reply));
       },
       kReplyTimeout);
   if (auto failure = transportFailure(outcome)) {
@@ -131,22 +135,24 @@ int holdAndWait(const char* service, uint64_t flags, std::vector<std::string> pa
   }
   if (auto refused = VTDaemonClient::errorInReply(outcome.value())) {
     printError(*refused);
-  } else if (auto token = outcome.value().message()->body().get("uuids").getIfUuid()) {
+  } else if (auto token = outcome.value().message()->body().get(protocol::kKeyUuids).getIfUuid()) {
     printLine("held " + token->string());
   } else {
-    printLine("error 4 hold granted without a token");
+    printError(
+        vantrel::base::error_with_code(protocol::kErrorBadRequest, "hold granted without a token"));
   }
   return blockUntilStdinCloses();
 }
 
 // "ok", with the identifiers of the forms in a match reply's "matches".
 std::string describeSuccess(const vantrel::lmo::Dictionary& reply) {
-  const vantrel::lmo::Array* forms = reply.get("matches").getIfArray();
+  const vantrel::lmo::Array* forms = reply.get(protocol::kKeyMatches).getIfArray();
   if (forms == nullptr) return "ok";
   std::string identifiers;
   for (const vantrel::lmo::Value& form : *forms) {
     const vantrel::lmo::Dictionary* fields = form.getIfDictionary();
-    const std::string* identifier = fields ? fields->get("identifier").getIfString() : nullptr;
+    const std::string* identifier =
+        fields ? fields->get(protocol::kFormIdentifier).getIfString() : nullptr;
     if (!identifiers.empty()) identifiers += ',';
     identifiers += identifier ? *identifier : "?";
   }
@@ -156,8 +162,9 @@ std::string describeSuccess(const vantrel::lmo::Dictionary& reply) {
 int requestAndWait(const char* service, const char* type, uint64_t flags,
                    const std::vector<vantrel::base::Uuid>& uuids) {
   auto client = VTDaemonClient::initWithServiceName(service);
-  const auto message = VTDaemonClient::set(client->request(type), uuids)
-                           .setting("flags", vantrel::lmo::Value::unsignedInteger(flags));
+  const auto message =
+      VTDaemonClient::set(client->request(type), uuids)
+          .setting(protocol::kKeyFlags, vantrel::lmo::Value::unsignedInteger(flags));
   auto outcome = client->sendSync(message, kReplyTimeout);
   if (auto failure = transportFailure(outcome)) {
     printError(*failure);

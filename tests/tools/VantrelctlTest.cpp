@@ -234,6 +234,7 @@ class Vantrelctl : public ::testing::Test {
 
 TEST_F(Vantrelctl, ExitStatusesAndTheirMessages) {
   const std::string nowhere = tmp_.file("run/nobody-here");
+  const std::string accessDenied = "(code " + std::to_string(protocol::kErrorAccessDenied) + ")";
   struct Case {
     std::vector<std::string> args;
     int status;
@@ -270,13 +271,13 @@ TEST_F(Vantrelctl, ExitStatusesAndTheirMessages) {
        ""},
       {{"list", "--all"},
        kExitRefused,
-       {"(code 11)",
-        "--all needs the entitlement \"com.karvo.private.vantrel.manager\" and an "
-        "unsandboxed process"},
+       {accessDenied, "--all needs the entitlement \"" +
+                          std::string(protocol::kManagerEntitlement) +
+                          "\" and an unsandboxed process"},
        ""},
       {{"why", plugIn("Alpha", "Share"), "--host", "1"},
        kExitRefused,
-       {"explaining for another host requires", "(code 11)"},
+       {"explaining for another host requires", accessDenied},
        ""},
   };
   for (const Case& c : cases) {
@@ -301,7 +302,8 @@ TEST_F(Vantrelctl, ExitStatusesAndTheirMessages) {
 TEST_F(Vantrelctl, StatusNamesTheDaemon) {
   const Outcome human = ctl({"status"});
   EXPECT_EQ(human.status, kExitOk);
-  EXPECT_NE(human.out.find("Socket:     " + tmp_.file("run/com.karvo.vantrel.vantreld")),
+  EXPECT_NE(human.out.find("Socket:     " +
+                           tmp_.file(std::string("run/") + protocol::kDefaultServiceName)),
             std::string::npos)
       << human.out;
   EXPECT_NE(human.out.find("answering (pid " + std::to_string(daemon_->pid()) + ")"),
@@ -484,7 +486,9 @@ TEST_F(Vantrelctl, AddAndRemoveReportEachPath) {
   const Outcome add = ctl({"add", extra, missing});
   EXPECT_EQ(add.status, kExitRefused);
   EXPECT_NE(add.out.find("added " + extra + "\n"), std::string::npos) << add.out;
-  EXPECT_NE(add.err.find("invalid plugin path: " + missing + " (code 9)"), std::string::npos)
+  EXPECT_NE(add.err.find("invalid plugin path: " + missing + " (code " +
+                         std::to_string(protocol::kErrorBadPath) + ")"),
+            std::string::npos)
       << add.err;
   const Value removed = json(ctl({"remove", extra, missing, "--json"}));
   const lmo::Array* outcomes = removed.getIfArray();

@@ -29,9 +29,12 @@ inline constexpr const char* kDiscoveryFlagHelp =
     "  --versions    keep every version of an identifier, not only the highest\n"
     "  --duplicates  with --versions, keep registrations of equal versions too\n"
     "  --system      only plug-ins on the system volume\n";
-inline constexpr const char* kAllFlagHelp =
-    "  --all         skip the location, dedication, hold and authorisation filters\n"
-    "                (needs the entitlement \"com.karvo.private.vantrel.manager\"\n"
-    "                and an unsandboxed process)\n";
+inline std::string allFlagHelp() {
+  return "  --all         skip the location, dedication, hold and authorisation filters\n"
+         "                (needs the entitlement \"" +
+         std::string(protocol::kManagerEntitlement) +
+         "\"\n"
+         "                and an unsandboxed process)\n";
+}
 
 }  // namespace vantrel::ctl

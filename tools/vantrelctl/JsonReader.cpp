@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "base/Format.h"
+#include "lmo/Protocol.h"
 
 namespace vantrel::ctl {
 namespace {
@@ -33,7 +34,7 @@ class Reader {
 
  private:
   base::Error failure() const {
-    return base::error_with_code_and_format(base::kErrorBadRequest, "%@ at byte %u", error_,
+    return base::error_with_code_and_format(protocol::kErrorBadRequest, "%@ at byte %u", error_,
                                             static_cast<uint64_t>(errorAt_));
   }
   // Records the first fault only: callers unwind with nullopt.

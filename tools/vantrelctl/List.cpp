@@ -30,7 +30,7 @@ Command listCommand() {
                       "or the containing application) and PATH. --json prints the plug-in\n"
                       "forms as an array.\n"
                       "  --point ID    only plug-ins of the extension point ID\n") +
-              kDiscoveryFlagHelp + kAllFlagHelp +
+              kDiscoveryFlagHelp + allFlagHelp() +
               "\nExample:\n"
               "  vantrelctl list --point com.karvo.share-services --versions\n",
           options,

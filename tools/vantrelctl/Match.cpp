@@ -53,7 +53,7 @@ Command matchCommand() {
                       "that names the byte where it went wrong. The rule language is in\n"
                       "docs/match-rules.md.\n"
                       "  --rule KEY=PATTERN  one rule (repeatable)\n") +
-              kDiscoveryFlagHelp + kAllFlagHelp +
+              kDiscoveryFlagHelp + allFlagHelp() +
               "\nExamples:\n"
               "  vantrelctl match '{\"QXExtensionPointIdentifier\": \"com.karvo.widget\"}'\n"
               "  vantrelctl match --rule QXUserElection=1\n",

@@ -16,7 +16,6 @@ inline constexpr const char* kJsonAnswering = "answering";
 inline constexpr const char* kJsonEvent = "event";
 inline constexpr const char* kJsonOld = "old";
 inline constexpr const char* kJsonOk = "ok";
-inline constexpr const char* kJsonCode = "errorcode";
 
 // Whether standard output is a terminal that takes colour (bold headers).
 bool colourWanted();

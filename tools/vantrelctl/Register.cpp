@@ -28,7 +28,7 @@ int registration(Context& context, const char* request, const char* done) {
     Dictionary outcome{{protocol::kKeyPath, Value(path)}, {kJsonOk, Value::boolean(answer.ok())}};
     if (!answer.ok()) {
       status = kExitRefused;
-      outcome = outcome.setting(kJsonCode, Value::integer(answer.code))
+      outcome = outcome.setting(protocol::kKeyErrorCode, Value::integer(answer.code))
                     .setting(protocol::kKeyError, answer.reply.get(protocol::kKeyError));
       if (!context.global.json) context.session.complain(answer);
     } else if (!context.global.json) {

@@ -4,6 +4,7 @@
 #include <cstdio>
 #include <string>
 
+#include "lmo/Protocol.h"
 #include "tools/vantrelctl/Command.h"
 #include "tools/vantrelctl/ExitStatus.h"
 
@@ -12,15 +13,19 @@ namespace {
 using vantrel::ctl::Command;
 using vantrel::ctl::commands;
 
-constexpr const char* kGlobalHelp =
-    "Options (before or after the command):\n"
-    "  -S, --service NAME  the daemon's service name, or its socket path when NAME\n"
-    "                      starts with \"/\" (default com.karvo.vantrel.vantreld)\n"
-    "      --json          machine output: one JSON document on standard output\n"
-    "      --no-legend     no header row or footer, for scripts\n"
-    "      --timeout SECS  give up on any request after SECS seconds (default 10)\n"
-    "  -h, --help          this help, or the command's\n"
-    "      --version       print the version\n";
+std::string globalHelp() {
+  return std::string(
+             "Options (before or after the command):\n"
+             "  -S, --service NAME  the daemon's service name, or its socket path when NAME\n"
+             "                      starts with \"/\" (default ") +
+         vantrel::protocol::kDefaultServiceName +
+         ")\n"
+         "      --json          machine output: one JSON document on standard output\n"
+         "      --no-legend     no header row or footer, for scripts\n"
+         "      --timeout SECS  give up on any request after SECS seconds (default 10)\n"
+         "  -h, --help          this help, or the command's\n"
+         "      --version       print the version\n";
+}
 
 const Command* find(const std::string& name) {
   for (const Command& c : commands()) {
@@ -35,11 +40,12 @@ void printUsage(std::FILE* out) {
   std::fprintf(out,
                "\n%s\nExit status: 0 done, 1 the daemon refused, 2 usage error, 3 the daemon\n"
                "cannot be reached. \"vantrelctl help COMMAND\" shows a command's help.\n",
-               kGlobalHelp);
+               globalHelp().c_str());
 }
 
 void printCommandHelp(const Command& c, std::FILE* out) {
-  std::fprintf(out, "usage: vantrelctl %s\n\n%s\n%s", c.synopsis, c.help.c_str(), kGlobalHelp);
+  std::fprintf(out, "usage: vantrelctl %s\n\n%s\n%s", c.synopsis, c.help.c_str(),
+               globalHelp().c_str());
 }
 
 int usageError(const char* message, const std::string& detail) {

@@ -14,15 +14,15 @@
 
 #include "base/Log.h"
 #include "daemon/VTDServer.h"
+#include "lmo/Protocol.h"
 
 namespace {
 
-constexpr const char* kDefaultServiceName = "com.karvo.vantrel.vantreld";
 constexpr int kExitUsage = 2;
 constexpr int kExitNoServer = 1;
 
 struct Options {
-  const char* service = kDefaultServiceName;
+  const char* service = vantrel::protocol::kDefaultServiceName;
   const char* database = nullptr;
   uint32_t cacheLimit = vantrel::registry::kDefaultCacheLimit;
   uint32_t verbose = 0;
