@@ -3,6 +3,10 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
+#include <iterator>
+
+#include "lmo/Protocol.h"
+#include "model/MetadataKeys.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::tools {
@@ -27,22 +31,28 @@ TEST_F(InspectionTest, EverySampleGetsItsVerdict) {
     bool built;
     const char* message;  // nullptr: valid
   } cases[] = {
+      // The story scripts/demo tells: Notes.app and Journal.app.
       {"Notes.app/PlugIns/NotesShare.appex", true, nullptr},
       {"Notes.app/PlugIns/NotesWidget.appex", true, nullptr},
-      {"Notes.app/PlugIns/NotesSync.appex", true, nullptr},
+      {"Notes.app/PlugIns/Markdown.appex", true, nullptr},
+      {"Journal.app/PlugIns/Markdown.appex", true, nullptr},
+      {"Journal.app/PlugIns/JournalShare.appex", true,
+       "Application Extensions may not use the \"PrincipalClass\" key"},
+      // One bundle per mistake (Toolbox.app), and an old-style plug-in.
+      {"Toolbox.app/PlugIns/Sync.appex", true, nullptr},
       {"Legacy.plugin", true, nullptr},
       {"Toolbox.app/PlugIns/Speller.plugin", true,
        "missing \"QXExtensionProtocol\" key in Info.plist or SDK"},
       {"Toolbox.app/PlugIns/Linter.plugin", true,
        "missing \"QXExtensionAttributes\" key in Info.plist or SDK"},
-      {"Notes.app/PlugIns/NotesCustom.appex", true,
-       "Application Extensions may not use the \"PrincipalClass\" key"},
-      {"Notes.app/PlugIns/NotesProxy.appex", true,
+      {"Toolbox.app/PlugIns/Proxy.appex", true,
        "the \"PassProxy\" key is not supported on this platform"},
       {"Toolbox.app/PlugIns/Bridge.plugin", true,
        "hybrid plug-ins are not supported on this platform"},
       {"Toolbox.app/PlugIns/Nameless.plugin", false, nullptr},
   };
+  // A sample added without an expectation fails here.
+  EXPECT_EQ(findPlugInBundles(examples_ + "/bundles").size(), std::size(cases));
   for (const Case& c : cases) {
     Inspection in = inspect(c.bundle);
     EXPECT_EQ(in.built, c.built) << c.bundle << ": " << in.failure;
@@ -61,21 +71,21 @@ TEST_F(InspectionTest, RecordsShowMergedSdkOldStyleAndLogLines) {
   Inspection widget = inspect("Notes.app/PlugIns/NotesWidget.appex");
   EXPECT_EQ(widget.protocol, "WidgetProviding");  // supplied by the SDK
   EXPECT_EQ(widget.version, "1.0");               // SDK's attributes fill the gap
-  const lmo::Dictionary* info = widget.form.get("info").getIfDictionary();
+  const lmo::Dictionary* info = widget.form.get(protocol::kFormInfo).getIfDictionary();
   ASSERT_NE(info, nullptr);
-  EXPECT_EQ(info->get("CleanTimeout"), lmo::Value::integer(60));  // the SDK wins this key
-  EXPECT_EQ(info->get("Shared"),
+  EXPECT_EQ(info->get(model::kCleanTimeoutKey), lmo::Value::integer(60));  // the SDK wins this key
+  EXPECT_EQ(info->get(model::kSharedKey),
             lmo::Value(lmo::Array{lmo::Value("Resources/Common"), lmo::Value("Resources/Widget")}));
-  EXPECT_EQ(widget.form.get("hubProtocolVersion"), lmo::Value::integer(2));
+  EXPECT_EQ(widget.form.get(protocol::kFormHubProtocolVersion), lmo::Value::integer(2));
   EXPECT_EQ(widget.containingApp, examples_ + "/bundles/Notes.app");
 
   Inspection legacy = inspect("Legacy.plugin");
   EXPECT_EQ(legacy.style, "old-style plug-in");
   EXPECT_EQ(legacy.version, "7.0.2");
-  EXPECT_EQ(legacy.form.get("hubProtocolVersion"), lmo::Value::integer(1));
+  EXPECT_EQ(legacy.form.get(protocol::kFormHubProtocolVersion), lmo::Value::integer(1));
   EXPECT_TRUE(legacy.containingApp.empty());
 
-  Inspection sync = inspect("Notes.app/PlugIns/NotesSync.appex");
+  Inspection sync = inspect("Toolbox.app/PlugIns/Sync.appex");
   EXPECT_EQ(sync.log,
             (std::vector<std::string>{"multiplexed plug-ins (Multiple key) obsolete and ignored",
                                       "plug-in sdk \"com.karvo.file-provider\" not registered"}));
