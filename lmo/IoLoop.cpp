@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <future>
 
 #include "base/Check.h"
 
@@ -79,6 +80,16 @@ void IoLoop::post(std::function<void()> task) {
   uint64_t one = 1;
   ssize_t n = ::write(wakeFd_, &one, sizeof one);
   (void)n;  // EAGAIN means the counter is already non-zero: the loop wakes anyway
+}
+
+void IoLoop::runAndWait(const std::function<void()>& task) {
+  if (isCurrent()) return task();
+  std::promise<void> ran;
+  post([&] {
+    task();
+    ran.set_value();
+  });
+  ran.get_future().wait();
 }
 
 bool IoLoop::isCurrent() const {

@@ -44,6 +44,9 @@ class IoLoop {
 
   // Runs task on the I/O thread, after the I/O callbacks in progress.
   void post(std::function<void()> task);
+  // Runs task on the I/O thread and waits for it (at once when called
+  // there), so that the caller sees registrations as the task left them.
+  void runAndWait(const std::function<void()>& task);
   bool isCurrent() const;
 
   // Gives every registered source its terminationImminent() callback

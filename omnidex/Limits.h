@@ -24,6 +24,9 @@ inline constexpr size_t kMaxRegisteredPlugIns = 100000;
 // inotify watches one registry adds at most (the kernel has its own limit,
 // max_user_watches, which is met with the same log line).
 inline constexpr size_t kMaxWatches = 200000;
+// inotify events read but not yet handled on the watcher's queue; past it
+// the watcher rescans everything, as after the kernel's own queue overflows.
+inline constexpr size_t kMaxUnhandledEventBytes = 4 * 1024 * 1024;
 
 // Longest application bundle identifier or service identifier in the
 // privacy-consent store; a longer one is refused.

@@ -1,16 +1,17 @@
 #include "omnidex/Watcher.h"
 
-#include <poll.h>
-#include <sys/eventfd.h>
 #include <sys/inotify.h>
+#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <utility>
 
 #include "base/Log.h"
+#include "lmo/IoLoop.h"
 #include "omnidex/BundlePaths.h"
 #include "omnidex/Limits.h"
 #include "platform/AtomicFile.h"
@@ -37,42 +38,103 @@ std::string parentOf(const std::string& path) {
 
 }  // namespace
 
+// Watches one of the watcher's descriptors on the I/O loop. The I/O thread
+// only drains the descriptor and hands what it read to the watcher's queue.
+class Watcher::Source : public lmo::IoSource {
+ public:
+  Source(Watcher* watcher, int fd, bool timer) : watcher_(watcher), fd_(fd), timer_(timer) {}
+
+  void handleIo(uint32_t) override {
+    Watcher* const watcher = watcher_;
+    if (timer_) {
+      uint64_t expirations = 0;
+      while (::read(fd_, &expirations, sizeof expirations) < 0 && errno == EINTR) {
+      }
+      watcher->queue_->async([watcher] { watcher->flushIfDue(); });
+      return;
+    }
+    std::vector<char> bytes;
+    bool overflow = false;
+    alignas(inotify_event) char buffer[kEventBufferBytes];
+    while (true) {
+      const ssize_t n = ::read(fd_, buffer, sizeof buffer);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) break;  // EAGAIN: drained
+      // Events the queue has not caught up with are bounded like the
+      // kernel's own queue: past the bound they stand for "everything".
+      if (unhandled_.load(std::memory_order_relaxed) + bytes.size() + n > kMaxUnhandledEventBytes) {
+        overflow = true;
+        continue;
+      }
+      bytes.insert(bytes.end(), buffer, buffer + n);
+    }
+    if (bytes.empty() && !overflow) return;
+    unhandled_.fetch_add(bytes.size(), std::memory_order_relaxed);
+    watcher->queue_->async([this, watcher, bytes = std::move(bytes), overflow] {
+      unhandled_.fetch_sub(bytes.size(), std::memory_order_relaxed);
+      if (overflow) watcher->noteAll();
+      watcher->handleEvents(bytes);
+    });
+  }
+
+  uint64_t token = 0;
+
+ private:
+  Watcher* const watcher_;  // outlives the source: ~Watcher removes it first
+  const int fd_;
+  const bool timer_;
+  std::atomic<size_t> unhandled_{0};
+};
+
 base::Result<std::unique_ptr<Watcher>> Watcher::create(std::vector<ScanRoot> roots,
                                                        ChangeHandler handler) {
   const int inotifyFd = ::inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
   if (inotifyFd < 0)
     return platform::posixError(errno, "cannot watch", "the application directories");
-  const int wakeFd = ::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
-  if (wakeFd < 0) {
+  const int timerFd = ::timerfd_create(CLOCK_MONOTONIC, TFD_NONBLOCK | TFD_CLOEXEC);
+  if (timerFd < 0) {
     const int err = errno;
     ::close(inotifyFd);
     return platform::posixError(err, "cannot watch", "the application directories");
   }
   std::unique_ptr<Watcher> watcher(
-      new Watcher(std::move(roots), std::move(handler), inotifyFd, wakeFd));
+      new Watcher(std::move(roots), std::move(handler), inotifyFd, timerFd));
   for (size_t i = 0; i < watcher->roots_.size(); ++i) watcher->watchRoot(i);
   return watcher;
 }
 
-Watcher::Watcher(std::vector<ScanRoot> roots, ChangeHandler handler, int inotifyFd, int wakeFd)
+Watcher::Watcher(std::vector<ScanRoot> roots, ChangeHandler handler, int inotifyFd, int timerFd)
     : roots_(std::move(roots)),
       handler_(std::move(handler)),
       inotifyFd_(inotifyFd),
-      wakeFd_(wakeFd) {}
+      timerFd_(timerFd),
+      queue_(
+          std::make_shared<base::SerialQueue>("omnidex.watcher", base::QueuePriority::kUtility)) {}
 
 Watcher::~Watcher() {
-  if (thread_.joinable()) {
-    const uint64_t one = 1;
-    while (::write(wakeFd_, &one, sizeof one) < 0 && errno == EINTR) {
-    }
-    thread_.join();
-  }
+  lmo::IoLoop& loop = lmo::IoLoop::shared();
+  loop.runAndWait([&] {
+    if (inotifySource_) loop.remove(inotifyFd_, inotifySource_->token);
+    if (timerSource_) loop.remove(timerFd_, timerSource_->token);
+    inotifySource_.reset();
+    timerSource_.reset();
+  });
+  // Nothing is handed to the queue any more; this waits for what already
+  // was, a handler call in progress included.
+  queue_->sync([] {});
   ::close(inotifyFd_);
-  ::close(wakeFd_);
+  ::close(timerFd_);
 }
 
 void Watcher::start() {
-  thread_ = std::thread([this] { run(); });
+  lmo::IoLoop& loop = lmo::IoLoop::shared();
+  loop.runAndWait([&] {
+    if (inotifySource_) return;
+    inotifySource_ = std::make_shared<Source>(this, inotifyFd_, false);
+    timerSource_ = std::make_shared<Source>(this, timerFd_, true);
+    inotifySource_->token = loop.add(inotifyFd_, EPOLLIN, inotifySource_);
+    timerSource_->token = loop.add(timerFd_, EPOLLIN, timerSource_);
+  });
 }
 
 void Watcher::noteWatchLimit(const std::string& path) {
@@ -127,46 +189,43 @@ void Watcher::watchItem(size_t root, const std::string& item) {
   }
 }
 
-void Watcher::run() {
-  while (true) {
-    const bool waiting = pendingAll_ || !pending_.empty();
-    int timeoutMs = -1;
-    if (waiting) {
-      const Clock::time_point due =
-          std::min(lastChange_ + kWatchQuietPeriod, firstChange_ + kWatchMaxDelay);
-      const auto left = std::chrono::ceil<std::chrono::milliseconds>(due - Clock::now());
-      timeoutMs = static_cast<int>(std::max<int64_t>(0, left.count()));
-    }
-    pollfd fds[2] = {{inotifyFd_, POLLIN, 0}, {wakeFd_, POLLIN, 0}};
-    const int n = ::poll(fds, 2, timeoutMs);
-    if (n < 0 && errno != EINTR) {
-      base::vtlog("cannot watch %@: %@", "the application directories", std::strerror(errno));
-      return;
-    }
-    if (n > 0 && (fds[1].revents & POLLIN) != 0) return;
-    if (n > 0 && (fds[0].revents & POLLIN) != 0) readEvents();
-    if (pendingAll_ || !pending_.empty()) {
-      const Clock::time_point now = Clock::now();
-      if (now >= lastChange_ + kWatchQuietPeriod || now >= firstChange_ + kWatchMaxDelay) flush();
-    }
+void Watcher::handleEvents(const std::vector<char>& bytes) {
+  queue_->assertCurrent();
+  size_t offset = 0;
+  while (offset + sizeof(inotify_event) <= bytes.size()) {
+    inotify_event event;
+    std::memcpy(&event, bytes.data() + offset, sizeof event);
+    const size_t next = offset + sizeof(inotify_event) + event.len;
+    if (next > bytes.size()) break;
+    const char* name = bytes.data() + offset + sizeof(inotify_event);
+    handleEvent(event.wd, event.mask,
+                std::string_view(name, event.len == 0 ? 0 : ::strnlen(name, event.len)));
+    offset = next;
+  }
+  if (pendingAll_ || !pending_.empty()) {
+    armTimer(std::min(lastChange_ + kWatchQuietPeriod, firstChange_ + kWatchMaxDelay));
   }
 }
 
-void Watcher::readEvents() {
-  alignas(inotify_event) char buffer[kEventBufferBytes];
-  while (true) {
-    const ssize_t n = ::read(inotifyFd_, buffer, sizeof buffer);
-    if (n <= 0) return;  // EAGAIN: drained
-    size_t offset = 0;
-    while (offset + sizeof(inotify_event) <= static_cast<size_t>(n)) {
-      const auto* event = reinterpret_cast<const inotify_event*>(buffer + offset);
-      const size_t next = offset + sizeof(inotify_event) + event->len;
-      if (next > static_cast<size_t>(n)) break;
-      const std::string_view name(event->name,
-                                  event->len == 0 ? 0 : ::strnlen(event->name, event->len));
-      handleEvent(event->wd, event->mask, name);
-      offset = next;
-    }
+void Watcher::armTimer(Clock::time_point due) {
+  // steady_clock is CLOCK_MONOTONIC, the timer's clock.
+  const auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(due.time_since_epoch());
+  itimerspec spec{};
+  spec.it_value.tv_sec = static_cast<time_t>(ns.count() / 1000000000);
+  spec.it_value.tv_nsec = static_cast<long>(ns.count() % 1000000000);
+  if (spec.it_value.tv_sec == 0 && spec.it_value.tv_nsec == 0) spec.it_value.tv_nsec = 1;
+  ::timerfd_settime(timerFd_, TFD_TIMER_ABSTIME, &spec, nullptr);
+}
+
+void Watcher::flushIfDue() {
+  queue_->assertCurrent();
+  if (!pendingAll_ && pending_.empty()) return;
+  const Clock::time_point due =
+      std::min(lastChange_ + kWatchQuietPeriod, firstChange_ + kWatchMaxDelay);
+  if (Clock::now() >= due) {
+    flush();
+  } else {
+    armTimer(due);  // changes came in since the timer was set
   }
 }
 

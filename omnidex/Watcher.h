@@ -12,18 +12,23 @@
 //
 // Changes are coalesced: the handler runs once the trees have been quiet
 // for kWatchQuietPeriod, and at the latest kWatchMaxDelay after the first
-// change, on the watcher's own thread, one call at a time.
+// change, on the watcher's own serial queue, one call at a time.
+//
+// The inotify descriptor and the coalescing timer (a timerfd) are watched
+// by the process's I/O loop, whose thread only reads them and hands the
+// bytes and expiries to the queue; the watch table and every directory
+// listing live on the queue.
 
 #include <chrono>
 #include <functional>
 #include <memory>
 #include <set>
 #include <string>
-#include <thread>
 #include <unordered_map>
 #include <vector>
 
 #include "base/Result.h"
+#include "base/SerialQueue.h"
 #include "omnidex/Scanner.h"
 
 namespace vantrel::omnidex {
@@ -36,13 +41,13 @@ class Watcher {
   using ChangeHandler = std::function<void(const std::vector<std::string>& items, bool all)>;
 
   // Sets up inotify and watches the trees as they are now; nothing is
-  // reported before start(). Errors (domain "POSIX"): inotify or the wake-up
+  // reported before start(). Errors (domain "POSIX"): inotify or the timer
   // descriptor cannot be made. A watch that cannot be added is not an error:
   // it is logged (the watch limit once) and the rest is watched.
   static base::Result<std::unique_ptr<Watcher>> create(std::vector<ScanRoot> roots,
                                                        ChangeHandler handler);
-  // Stops the thread (waiting for a handler call in progress) and closes
-  // the descriptors.
+  // Stops watching (waiting for a handler call in progress) and closes the
+  // descriptors; the handler is not called afterwards.
   ~Watcher();
   Watcher(const Watcher&) = delete;
   Watcher& operator=(const Watcher&) = delete;
@@ -65,27 +70,31 @@ class Watcher {
     bool operator==(const Target&) const = default;
   };
 
-  Watcher(std::vector<ScanRoot> roots, ChangeHandler handler, int inotifyFd, int wakeFd);
+  class Source;
+
+  Watcher(std::vector<ScanRoot> roots, ChangeHandler handler, int inotifyFd, int timerFd);
   void watchRoot(size_t root);
   void watchItem(size_t root, const std::string& item);
   bool addWatch(Target target, bool followLink);
-  void run();
-  void readEvents();
+  void handleEvents(const std::vector<char>& bytes);
   void handleEvent(int wd, uint32_t mask, std::string_view name);
   void noteWatchLimit(const std::string& path);
   void touch();
   void noteAll();
   void noteChange(std::string item);
+  void flushIfDue();
   void flush();
+  void armTimer(Clock::time_point due);
 
   // Constant after construction.
   const std::vector<ScanRoot> roots_;
   const ChangeHandler handler_;
   const int inotifyFd_;
-  const int wakeFd_;
+  const int timerFd_;
+  const std::shared_ptr<base::SerialQueue> queue_;
 
-  // Touched by the creating thread until start(), then only by the watcher
-  // thread (thread creation orders the two).
+  // Touched by the creating thread until start(), then only on queue_
+  // (start() submits the first block, which orders the two).
   std::unordered_map<int, std::vector<Target>> targets_;
   size_t watchCount_ = 0;
   bool loggedWatchLimit_ = false;
@@ -94,7 +103,10 @@ class Watcher {
   Clock::time_point firstChange_;
   Clock::time_point lastChange_;
 
-  std::thread thread_;
+  // The I/O loop's registrations; set by start() and cleared by the
+  // destructor, both on the I/O thread.
+  std::shared_ptr<Source> inotifySource_;
+  std::shared_ptr<Source> timerSource_;
 };
 
 }  // namespace vantrel::omnidex

@@ -13,7 +13,6 @@
 #include <charconv>
 #include <climits>
 #include <cstring>
-#include <future>
 #include <map>
 #include <mutex>
 #include <set>
@@ -196,18 +195,7 @@ class ServiceManager::HostWatcher {
     uint64_t token = 0;
   };
 
-  // Runs task on the I/O thread and waits for it, so that callers see the
-  // watch set as they left it.
-  static void onLoop(const std::function<void()>& task) {
-    lmo::IoLoop& loop = lmo::IoLoop::shared();
-    if (loop.isCurrent()) return task();
-    std::promise<void> ran;
-    loop.post([&] {
-      task();
-      ran.set_value();
-    });
-    ran.get_future().wait();
-  }
+  static void onLoop(const std::function<void()>& task) { lmo::IoLoop::shared().runAndWait(task); }
 
   // On the I/O thread.
   void forget(const Host* host) {
