@@ -23,6 +23,7 @@ enum OmnidexErrorCode : int64_t {
   kOmnidexSchemaMismatch = 8,   // the database was written by another schema version
   kOmnidexFull = 9,             // kMaxRegisteredPlugIns or a privacy-consent limit reached
   kOmnidexBadIdentifier = 10,   // a consent identifier empty, too long, or holding a NUL character
+  kOmnidexStateInUse = 11,      // another registry holds the state directory
 };
 
 inline base::Error omnidexError(int64_t code, std::string message) {

@@ -1,5 +1,10 @@
 #include "omnidex/Omnidex.h"
 
+#include <fcntl.h>
+#include <sys/file.h>
+#include <unistd.h>
+
+#include <cerrno>
 #include <utility>
 
 #include "base/Log.h"
@@ -7,13 +12,18 @@
 #include "omnidex/Errors.h"
 #include "omnidex/OmnidexState.h"
 #include "omnidex/RecordFactory.h"
+#include "platform/AtomicFile.h"
 #include "platform/Paths.h"
+#include "platform/ScopedFd.h"
 
 namespace vantrel::omnidex {
 namespace {
 
-constexpr mode_t kStateDirectoryMode = 0755;
+// The state directory holds the token secret and every plug-in's data
+// container: nobody else has any business listing it.
+constexpr mode_t kStateDirectoryMode = 0700;
 constexpr const char* kContainersDirectoryName = "containers";
+constexpr const char* kLockFileName = "registry.lock";
 
 // The configured directories as scan roots; a path that cannot be one (empty,
 // too long) is left out.
@@ -36,12 +46,41 @@ base::Error badPath(const std::string& path) {
   return omnidexError(kOmnidexBadPath, base::format("not a usable bundle path: %@", path));
 }
 
+// Takes the state directory for this registry: two processes on one
+// directory would each keep indexes that miss the other's changes, and
+// both would create and remove the same data containers. The lock is the
+// kernel's (flock on an open file), so it ends with the process however
+// the process ends, and a registry opened twice in one process is refused
+// alike. The holder's pid is written into the file to name it.
+base::Result<platform::ScopedFd> lockStateDirectory(const std::string& directory) {
+  const std::string path = childPath(directory, kLockFileName);
+  platform::ScopedFd fd(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
+  if (fd.get() < 0) return platform::posixError(errno, "cannot open", path);
+  if (::flock(fd.get(), LOCK_EX | LOCK_NB) != 0) {
+    if (errno != EWOULDBLOCK) return platform::posixError(errno, "cannot lock", path);
+    char holder[32] = {};
+    const ssize_t n = ::pread(fd.get(), holder, sizeof holder - 1, 0);
+    const std::string pid = n > 0 ? std::string(holder, static_cast<size_t>(n)) : "unknown";
+    return omnidexError(kOmnidexStateInUse,
+                        base::format("the state directory %@ is in use by another registry "
+                                     "(pid %@); one process may open it at a time",
+                                     directory, pid.substr(0, pid.find('\n'))));
+  }
+  const std::string pid = std::to_string(::getpid()) + "\n";
+  if (::ftruncate(fd.get(), 0) != 0 ||
+      ::pwrite(fd.get(), pid.data(), pid.size(), 0) != static_cast<ssize_t>(pid.size())) {
+    return platform::posixError(errno, "cannot write", path);
+  }
+  return fd;
+}
+
 }  // namespace
 
 base::Result<std::shared_ptr<Omnidex>> Omnidex::open(const OmnidexConfig& config) {
   std::optional<std::string> stateDirectory = normalizeBundlePath(config.stateDirectory);
   if (!stateDirectory) return badPath(config.stateDirectory);
   VT_TRY(platform::ensureDirectory(*stateDirectory, kStateDirectoryMode));
+  platform::ScopedFd lock = VT_TRY(lockStateDirectory(*stateDirectory));
   const std::string databasePath = childPath(*stateDirectory, kStoreFileName);
   std::unique_ptr<Store> store = VT_TRY(Store::open(databasePath));
   // After Store::open, which creates the database or checks its version.
@@ -50,6 +89,7 @@ base::Result<std::shared_ptr<Omnidex>> Omnidex::open(const OmnidexConfig& config
   omnidex->state_ = std::make_unique<State>(scanRoots(config), std::move(store),
                                             childPath(*stateDirectory, kContainersDirectoryName));
   omnidex->state_->consent = std::move(consent);
+  omnidex->state_->stateLock = std::move(lock);
   VT_TRY(omnidex->state_->containers.open());
   VT_TRY(omnidex->state_->load());
   return omnidex;

@@ -26,6 +26,7 @@
 #include "omnidex/Scanner.h"
 #include "omnidex/Store.h"
 #include "omnidex/Watcher.h"
+#include "platform/ScopedFd.h"
 
 namespace vantrel::omnidex {
 
@@ -60,6 +61,9 @@ struct Omnidex::State {
   // Set at open, then constant; thread-safe itself (it has its own
   // connection and lock), so consent never waits for writeMutex.
   std::unique_ptr<ConsentStore> consent;
+
+  // The state directory's lock, held for the registry's life; set at open.
+  platform::ScopedFd stateLock;
 
   mutable std::shared_mutex indexMutex;
   Indexes indexes;  // Guarded by indexMutex; written only with writeMutex held too.

@@ -14,6 +14,7 @@
 #include <memory>
 #include <vector>
 
+#include "lmo/Utf8.h"
 #include "platform/AtomicFile.h"
 #include "platform/PropertyListChecks.h"
 
@@ -92,6 +93,13 @@ base::Result<Value> NodeReader::date(plist_t node) {
   return Value(lmo::Date{static_cast<double>(timegm(&tm))});
 }
 
+// A binary list's ASCII strings are copied byte for byte and its UTF-16
+// ones converted without checking surrogates, so either can come out of
+// libplist as text that is not UTF-8, which no message may carry.
+base::Error notText() {
+  return malformed("a string or key that is not UTF-8");
+}
+
 base::Result<Value> NodeReader::array(plist_t node, int depth) {
   const uint32_t size = plist_array_get_size(node);
   std::vector<Value> items;
@@ -117,6 +125,7 @@ base::Result<Value> NodeReader::dictionary(plist_t node, int depth) {
     }
     std::string name(key != nullptr ? key : "");
     std::free(key);
+    if (!lmo::isValidUtf8(name)) return notText();
     auto value = read(child, depth + 1);
     if (!value.has_value()) return value.error();
     entries.emplace_back(std::move(name), std::move(value).value());
@@ -147,9 +156,10 @@ base::Result<Value> NodeReader::read(plist_t node, int depth) {
     case PLIST_STRING: {
       char* s = nullptr;
       plist_get_string_val(node, &s);
-      Value v(std::string(s != nullptr ? s : ""));
+      std::string text(s != nullptr ? s : "");
       std::free(s);
-      return v;
+      if (!lmo::isValidUtf8(text)) return notText();
+      return Value(std::move(text));
     }
     case PLIST_DATA: {
       char* bytes = nullptr;

@@ -19,6 +19,9 @@
 // - XML dates hold whole seconds; a fraction is dropped when written.
 // - Strings are C strings, so a string holding a NUL character cannot be read
 //   (it is refused as malformed) or written (code 3).
+// - Strings and keys are UTF-8 text, like every string of a message: a
+//   binary list whose strings are not (an "ASCII" string with high bytes, a
+//   lone UTF-16 surrogate) is refused as malformed.
 //
 // Every read is bounded and checked before libplist sees the bytes, since
 // libplist 2.2 can be crashed by deep XML nesting and made to expand a small

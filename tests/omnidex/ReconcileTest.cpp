@@ -1,3 +1,6 @@
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -157,6 +160,26 @@ TEST(OmnidexReconcile, RefusesDatabasesItCannotReadAndLeavesThemAlone) {
         << c.name << ": " << opened.error().description();
     EXPECT_EQ(readFile(db), bytes) << c.name;
   }
+}
+
+TEST(OmnidexReconcile, OneRegistryHoldsTheStateDirectoryAtATime) {
+  RegistryTree tree;
+  {
+    std::shared_ptr<Omnidex> first = tree.open();
+    ASSERT_TRUE(first);
+    struct stat st {};
+    ASSERT_EQ(::stat(tree.state().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0700u);
+    base::Result<std::shared_ptr<Omnidex>> second = Omnidex::open(tree.config());
+    ASSERT_FALSE(second.has_value());
+    EXPECT_EQ(second.error().code, kOmnidexStateInUse);
+    EXPECT_NE(second.error().description().find("in use by another registry (pid " +
+                                                std::to_string(::getpid()) + ")"),
+              std::string::npos)
+        << second.error().description();
+  }
+  // The lock ends with the registry that held it.
+  EXPECT_TRUE(Omnidex::open(tree.config()).has_value());
 }
 
 TEST(OmnidexReconcile, AnUnreadableRowIsSkippedAndTheRestLoads) {

@@ -179,6 +179,9 @@ TEST(PropertyList, RejectsMalformedInput) {
       {"binary ASCII NUL key", binary({"\xD1\x01\x02", std::string("\x53k\0y", 4), "\x09"})},
       {"binary lone surrogate", binary({"\x61\xD8\x00"})},
       {"binary 16-byte UID", binary({"\x8F" + std::string(16, '\0')})},
+      // libplist hands these over as text that is not UTF-8.
+      {"binary ASCII high byte", binary({"\x53" "a\xE9" "b"})},
+      {"binary ASCII high byte key", binary({"\xD1\x01\x02", "\x52k\xFF", "\x09"})},
   };
   const Cases tooLarge = {
       {"close hidden in comment",
