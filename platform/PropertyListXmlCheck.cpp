@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "base/Format.h"
+#include "lmo/Utf8.h"
 #include "platform/PropertyListChecks.h"
 
 namespace vantrel::platform::plist_checks {
@@ -410,6 +411,9 @@ std::optional<base::Error> XmlPreflight::leaf(const Tag& tag) {
 
 base::Result<std::string> XmlPreflight::run() {
   if (in_.find('\0') != std::string_view::npos) return malformed("NUL byte");
+  // Property lists are UTF-8 documents, and libplist copies whatever bytes
+  // it finds into strings and keys that messages must carry as text.
+  if (!lmo::isValidUtf8(in_)) return malformed("not UTF-8");
   if (startsWith("\xEF\xBB\xBF")) pos_ = 3;  // UTF-8 byte order mark
   while (true) {
     skipSpace();

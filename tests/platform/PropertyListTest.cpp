@@ -169,6 +169,7 @@ TEST(PropertyList, RejectsMalformedInput) {
       {"bad entity", xmlPlist("<string>&bogus;</string>")},
       {"unknown element", xmlPlist("<foo/>")},
       {"NUL byte", xmlPlist(std::string("<string>a\0b</string>", 20))},
+      {"not UTF-8", xmlPlist("<dict><key>k\xE9y</key><true/></dict>")},
       {"binary bad reference", binary({"\xA1\x05"})},
       {"binary huge count", binary({std::string("\xAF\x13\x10\0\0\0\0\0\0\0", 10)})},
       {"binary non-string key", binary({"\xD1\x01\x01", "\x10\x01"})},
