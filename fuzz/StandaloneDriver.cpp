@@ -1,5 +1,7 @@
 // Runs LLVMFuzzerTestOneInput over files and directories named on the command
-// line, for compilers without libFuzzer (GCC): replays a corpus or a crash.
+// line, in the builds without libFuzzer (GCC): replays a corpus or a crash.
+// A failed property or a fault stops it, so CTest fails on that input; the
+// input being replayed is printed first, so the failure names it.
 
 #include <cstdint>
 #include <cstdio>
@@ -13,7 +15,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
 namespace {
 
-// Inputs larger than this are skipped: they would exceed any frame anyway.
+// Inputs larger than this are skipped: every parser fuzzed refuses them.
 constexpr std::uintmax_t kMaxInputSize = 32 * 1024 * 1024;
 
 int runFile(const std::filesystem::path& path) {
@@ -22,6 +24,7 @@ int runFile(const std::filesystem::path& path) {
     std::fprintf(stderr, "skipping %s\n", path.c_str());
     return 0;
   }
+  std::fprintf(stderr, "replaying %s\n", path.c_str());
   std::ifstream in(path, std::ios::binary);
   std::vector<uint8_t> bytes((std::istreambuf_iterator<char>(in)),
                              std::istreambuf_iterator<char>());
