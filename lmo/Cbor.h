@@ -27,12 +27,10 @@
 #include <vector>
 
 #include "base/Result.h"
+#include "lmo/Limits.h"
 #include "lmo/Value.h"
 
 namespace vantrel::lmo {
-
-// Arrays and maps may nest this deep; a top-level map is at depth 1.
-inline constexpr int kMaxCborDepth = 64;
 
 // Appends the encoding of value to out. Error, with out left as it was:
 // arrays or dictionaries nested deeper than kMaxCborDepth, which no peer

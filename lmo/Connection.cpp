@@ -3,11 +3,13 @@
 #include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
+#include <sys/timerfd.h>
 #include <sys/un.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
+#include <unordered_map>
 
 #include "base/Check.h"
 #include "base/Log.h"
@@ -27,6 +29,21 @@ constexpr size_t kReadChunk = 64 * 1024;
 constexpr size_t kMaxReadPerWakeup = 4 * kReadChunk;
 
 std::atomic<size_t> gOpenConnections{0};
+std::atomic<size_t> gUnfinishedInput{0};
+
+// Accepted connections per peer user.
+std::mutex gUserMutex;
+std::unordered_map<uid_t, size_t> gUserConnections;  // Guarded by gUserMutex.
+
+void countUser(uid_t uid, bool open) {
+  std::lock_guard lock(gUserMutex);
+  if (open) {
+    ++gUserConnections[uid];
+  } else if (auto it = gUserConnections.find(uid);
+             it != gUserConnections.end() && --it->second == 0) {
+    gUserConnections.erase(it);
+  }
+}
 
 int peerPidfd(int fd, pid_t pid) {
   int pidfd = -1;
@@ -39,6 +56,58 @@ int peerPidfd(int fd, pid_t pid) {
 
 }  // namespace
 
+// Disconnects peers that stall in the middle of a frame: one timer for the
+// process, ticking while some connection holds an unfinished frame. Lives on
+// the I/O thread, like every connection's reader.
+class Connection::FrameDeadlines : public IoSource {
+ public:
+  static void watch(const std::shared_ptr<Connection>& connection) {
+    static const std::shared_ptr<FrameDeadlines> instance = [] {
+      auto made = std::make_shared<FrameDeadlines>();
+      IoLoop::shared().add(made->fd_, EPOLLIN, made);
+      return made;
+    }();
+    instance->add(connection);
+  }
+
+  FrameDeadlines() : fd_(::timerfd_create(CLOCK_MONOTONIC, TFD_NONBLOCK | TFD_CLOEXEC)) {
+    VT_CHECK(fd_ >= 0, "no timer for frame deadlines");
+  }
+
+  void handleIo(uint32_t) override {
+    uint64_t expirations = 0;
+    while (::read(fd_, &expirations, sizeof expirations) < 0 && errno == EINTR) {
+    }
+    const auto now = std::chrono::steady_clock::now();
+    std::vector<std::weak_ptr<Connection>> kept;
+    for (std::weak_ptr<Connection>& weak : watched_) {
+      std::shared_ptr<Connection> connection = weak.lock();
+      if (connection && connection->checkFrameDeadline(now)) kept.push_back(std::move(weak));
+    }
+    watched_ = std::move(kept);
+    if (watched_.empty()) arm(false);
+  }
+
+ private:
+  void add(const std::shared_ptr<Connection>& connection) {
+    for (const std::weak_ptr<Connection>& weak : watched_) {
+      if (weak.lock() == connection) return;
+    }
+    watched_.push_back(connection);
+    if (watched_.size() == 1) arm(true);
+  }
+
+  // A tick a second: a deadline is met to within a second.
+  void arm(bool on) {
+    itimerspec spec{};
+    if (on) spec.it_value.tv_sec = spec.it_interval.tv_sec = 1;
+    ::timerfd_settime(fd_, 0, &spec, nullptr);
+  }
+
+  const int fd_;
+  std::vector<std::weak_ptr<Connection>> watched_;
+};
+
 void releaseQueue(QueuePtr queue) {
   // A connection is often the last owner of its target queue, and often dies
   // on that queue's worker thread (inside a block, or as a finished block's
@@ -50,8 +119,8 @@ void releaseQueue(QueuePtr queue) {
   }
 }
 
-Connection::Connection(int fd, QueuePtr targetQueue)
-    : fd_(fd), targetQueue_(std::move(targetQueue)) {
+Connection::Connection(int fd, QueuePtr targetQueue, bool accepted)
+    : fd_(fd), accepted_(accepted), targetQueue_(std::move(targetQueue)) {
   VT_CHECK(targetQueue_ != nullptr, "connection without a target queue");
   if (fd_ < 0) return;
   gOpenConnections.fetch_add(1, std::memory_order_relaxed);
@@ -63,6 +132,7 @@ Connection::Connection(int fd, QueuePtr targetQueue)
     gid_ = cred.gid;
   }
   pidfd_ = peerPidfd(fd_, pid_);
+  if (accepted_) countUser(uid_, true);
 }
 
 std::shared_ptr<Connection> Connection::connectToService(std::string_view name,
@@ -84,12 +154,12 @@ std::shared_ptr<Connection> Connection::connectToService(std::string_view name,
     ::close(fd);
     fd = -1;
   }
-  return std::shared_ptr<Connection>(new Connection(fd, std::move(targetQueue)));
+  return std::shared_ptr<Connection>(new Connection(fd, std::move(targetQueue), false));
 }
 
 std::shared_ptr<Connection> Connection::fromAcceptedSocket(int fd, QueuePtr targetQueue) {
   VT_CHECK(fd >= 0, "accepted socket without a descriptor");
-  return std::shared_ptr<Connection>(new Connection(fd, std::move(targetQueue)));
+  return std::shared_ptr<Connection>(new Connection(fd, std::move(targetQueue), true));
 }
 
 Connection::~Connection() {
@@ -98,6 +168,7 @@ Connection::~Connection() {
   if (!closed_ && fd_ >= 0) {
     ::close(fd_);
     gOpenConnections.fetch_sub(1, std::memory_order_relaxed);
+    if (accepted_) countUser(uid_, false);
   }
   if (pidfd_ >= 0) ::close(pidfd_);
   if (finalizer_) finalizer_();
@@ -106,6 +177,16 @@ Connection::~Connection() {
 
 size_t Connection::openCount() {
   return gOpenConnections.load(std::memory_order_relaxed);
+}
+
+size_t Connection::openCountForUser(uid_t uid) {
+  std::lock_guard lock(gUserMutex);
+  auto it = gUserConnections.find(uid);
+  return it == gUserConnections.end() ? 0 : it->second;
+}
+
+size_t Connection::unfinishedInput() {
+  return gUnfinishedInput.load(std::memory_order_relaxed);
 }
 
 void Connection::setEventHandler(EventHandler handler) {
@@ -140,7 +221,10 @@ void Connection::setOutputLimitForTest(size_t bytes) {
 }
 
 uint32_t Connection::watchedEventsLocked() const {
-  return EPOLLIN | EPOLLRDHUP | (output_.empty() ? 0u : static_cast<uint32_t>(EPOLLOUT));
+  // A paused connection watches neither input nor the peer's half-close:
+  // both are level-triggered and would wake the loop until read.
+  return (readPaused_ ? 0u : static_cast<uint32_t>(EPOLLIN | EPOLLRDHUP)) |
+         (output_.empty() ? 0u : static_cast<uint32_t>(EPOLLOUT));
 }
 
 void Connection::resume() {
@@ -186,7 +270,31 @@ base::Result<void> Connection::sendWithReply(const Dictionary& message, QueuePtr
 
 base::Result<void> Connection::sendReply(const Reply& reply) {
   VT_CHECK(reply.inReplyTo != 0, "reply not made by createReply");
-  return sendFrame(FrameKind::kReply, reply.inReplyTo, reply.body, std::nullopt);
+  base::Result<void> sent = sendFrame(FrameKind::kReply, reply.inReplyTo, reply.body, std::nullopt);
+  noteAnswered();
+  return sent;
+}
+
+void Connection::noteAnswered() {
+  {
+    std::lock_guard lock(mutex_);
+    if (unanswered_ > 0) --unanswered_;
+    if (!readPaused_ || unanswered_ >= kMaxUnansweredRequests || closed_ || doomed_) return;
+    readPaused_ = false;
+  }
+  auto self = shared_from_this();
+  IoLoop::shared().post([self] { self->resumeReading(); });
+}
+
+void Connection::resumeReading() {
+  {
+    std::lock_guard lock(mutex_);
+    if (closed_ || readPaused_ || token_ == 0) return;
+    IoLoop::shared().modify(fd_, token_, watchedEventsLocked());
+  }
+  // The frames that waited were not the peer's delay.
+  if (reader_.hasPartialFrame()) frameStarted_ = std::chrono::steady_clock::now();
+  readAvailable();
 }
 
 base::Result<void> Connection::sendFrame(FrameKind kind, uint64_t inReplyTo, const Dictionary& body,
@@ -262,16 +370,28 @@ void Connection::handleIo(uint32_t events) {
       }
     }
   }
+  bool paused;
+  {
+    std::lock_guard lock(mutex_);
+    paused = readPaused_;
+  }
+  if (paused) {
+    // Hang-ups cannot be masked; with input paused, one means nobody is
+    // left to read the replies still due.
+    if (events & (EPOLLHUP | EPOLLERR)) invalidate(std::nullopt);
+    return;
+  }
   if (events & (EPOLLIN | EPOLLRDHUP | EPOLLHUP | EPOLLERR)) readAvailable();
 }
 
 void Connection::readAvailable() {
+  if (!drainFrames()) return;
   uint8_t buffer[kReadChunk];
   size_t total = 0;
   while (total < kMaxReadPerWakeup) {
     {
       std::lock_guard lock(mutex_);
-      if (closed_) return;
+      if (closed_ || readPaused_) return;
     }
     ssize_t n = ::recv(fd_, buffer, sizeof buffer, MSG_DONTWAIT);
     if (n < 0) {
@@ -290,23 +410,88 @@ void Connection::readAvailable() {
     }
     total += static_cast<size_t>(n);
     reader_.feed(buffer, static_cast<size_t>(n));
-    while (auto frame = reader_.next()) {
-      if (!frame->has_value()) {
-        invalidate(frame->error());
-        return;
-      }
-      if (!handleFrame(std::move(*frame).value())) return;
-    }
+    if (!drainFrames()) return;
     // The socket is drained: epoll is level-triggered, so anything that
     // arrives now wakes us again, and a second recv would only say EAGAIN.
     if (static_cast<size_t>(n) < sizeof buffer) return;
   }
 }
 
+bool Connection::drainFrames() {
+  while (true) {
+    {
+      std::lock_guard lock(mutex_);
+      if (closed_) return false;
+      if (readPaused_) break;
+    }
+    std::optional<base::Result<Frame>> frame = reader_.next();
+    if (!frame) break;
+    if (!frame->has_value()) {
+      invalidate(frame->error());
+      return false;
+    }
+    if (!handleFrame(std::move(*frame).value())) return false;
+  }
+  noteUnfinishedInput();
+  bool paused;
+  {
+    std::lock_guard lock(mutex_);
+    if (closed_) return false;
+    paused = readPaused_;
+  }
+  if (!paused && unfinishedBytes_ > 0 && Connection::unfinishedInput() > kMaxUnfinishedInput) {
+    invalidate(lmoErrorf(kLmoLimitExceeded, "unfinished frames of all peers exceed %u bytes",
+                         kMaxUnfinishedInput));
+    return false;
+  }
+  return !paused;
+}
+
+void Connection::noteUnfinishedInput() {
+  const size_t held = reader_.bufferedBytes();
+  if (held >= unfinishedBytes_) {
+    gUnfinishedInput.fetch_add(held - unfinishedBytes_, std::memory_order_relaxed);
+  } else {
+    gUnfinishedInput.fetch_sub(unfinishedBytes_ - held, std::memory_order_relaxed);
+  }
+  unfinishedBytes_ = held;
+  if (held == 0) {
+    frameStarted_.reset();
+  } else if (!frameStarted_ || reader_.framesRead() != framesSeen_) {
+    // A new frame began: its clock starts now.
+    frameStarted_ = std::chrono::steady_clock::now();
+    FrameDeadlines::watch(shared_from_this());
+  }
+  framesSeen_ = reader_.framesRead();
+}
+
+bool Connection::checkFrameDeadline(std::chrono::steady_clock::time_point now) {
+  {
+    std::lock_guard lock(mutex_);
+    if (closed_) return false;
+    if (readPaused_) return true;  // waiting on us, not on the peer
+  }
+  if (!frameStarted_) return false;
+  if (now - *frameStarted_ < kFrameDeadline) return true;
+  invalidate(lmoErrorf(kLmoLimitExceeded, "frame not completed within %u seconds",
+                       static_cast<uint64_t>(kFrameDeadline.count())));
+  return false;
+}
+
 // Returns false when the frame closed the connection.
 bool Connection::handleFrame(Frame&& frame) {
   if (frame.kind != FrameKind::kReply) {
-    deliver(IncomingMessage(std::move(frame.body), frame.id, frame.kind == FrameKind::kRequest));
+    const bool request = frame.kind == FrameKind::kRequest;
+    {
+      std::lock_guard lock(mutex_);
+      if (++unanswered_ >= kMaxUnansweredRequests && !readPaused_ && token_ != 0) {
+        readPaused_ = true;
+        IoLoop::shared().modify(fd_, token_, watchedEventsLocked());
+      }
+    }
+    // A request counts until its reply is sent, a message until its
+    // handler has run.
+    deliver(IncomingMessage(std::move(frame.body), frame.id, request), !request);
     return true;
   }
   std::unique_lock lock(mutex_);
@@ -325,7 +510,7 @@ bool Connection::handleFrame(Frame&& frame) {
   return true;
 }
 
-void Connection::deliver(Event event) {
+void Connection::deliver(Event event, bool counted) {
   EventHandler handler;
   QueuePtr queue;
   {
@@ -334,12 +519,22 @@ void Connection::deliver(Event event) {
     handler = handler_;
     queue = targetQueue_;
   }
-  if (!handler) return;
-  queue->async([handler = std::move(handler), event = std::move(event)] { handler(event); });
+  if (!handler) {
+    if (counted) noteAnswered();
+    return;
+  }
+  if (!counted) {
+    queue->async([handler = std::move(handler), event = std::move(event)] { handler(event); });
+    return;
+  }
+  queue->async([self = shared_from_this(), handler = std::move(handler), event = std::move(event)] {
+    handler(event);
+    self->noteAnswered();
+  });
 }
 
 void Connection::terminationImminent() {
-  deliver(ErrorEvent::kTerminationImminent);
+  deliver(ErrorEvent::kTerminationImminent, false);
 }
 
 void Connection::invalidate(std::optional<base::Error> reason) {
@@ -360,6 +555,7 @@ void Connection::invalidate(std::optional<base::Error> reason) {
     if (fd_ >= 0) {
       ::close(fd_);
       gOpenConnections.fetch_sub(1, std::memory_order_relaxed);
+      if (accepted_) countUser(uid_, false);
     }
     output_.clear();
     outputBytes_ = 0;
@@ -369,6 +565,8 @@ void Connection::invalidate(std::optional<base::Error> reason) {
     context = std::move(context_);
     queue = targetQueue_;
   }
+  gUnfinishedInput.fetch_sub(unfinishedBytes_, std::memory_order_relaxed);
+  unfinishedBytes_ = 0;
   if (reason) base::vtlog("closing connection from pid %d: %@", pid_, *reason);
   for (auto& [id, p] : pending) {
     p.queue->async([h = std::move(p.handler)] { h(ErrorEvent::kConnectionInvalid); });

@@ -18,6 +18,7 @@
 #include <sys/types.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <deque>
 #include <functional>
@@ -34,11 +35,9 @@
 #include "lmo/Event.h"
 #include "lmo/Frame.h"
 #include "lmo/IoLoop.h"
+#include "lmo/Limits.h"
 
 namespace vantrel::lmo {
-
-// Unsent output a peer may leave queued before it is disconnected.
-inline constexpr size_t kMaxPendingOutput = 64 * 1024 * 1024;
 
 using QueuePtr = std::shared_ptr<base::SerialQueue>;
 
@@ -105,8 +104,12 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // SO_PEERPIDFD nor pidfd_open could provide one. Owned by the connection.
   int pidfd() const { return pidfd_; }
 
-  // Live (not yet closed) connection sockets in this process.
+  // Live (not yet closed) connection sockets in this process, and the
+  // accepted ones whose peer is of user uid.
   static size_t openCount();
+  static size_t openCountForUser(uid_t uid);
+  // Bytes of unfinished frames held for all peers of this process.
+  static size_t unfinishedInput();
 
   void setOutputLimitForTest(size_t bytes);
 
@@ -120,14 +123,27 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
     EventHandler handler;
   };
 
-  Connection(int fd, QueuePtr targetQueue);
+  class FrameDeadlines;
+
+  Connection(int fd, QueuePtr targetQueue, bool accepted);
 
   base::Result<void> sendFrame(FrameKind kind, uint64_t inReplyTo, const Dictionary& body,
                                std::optional<PendingReply> pending);
   void writeLocked();
   void readAvailable();
+  // Hands out the complete frames buffered; false when the connection
+  // closed or stopped reading meanwhile.
+  bool drainFrames();
   bool handleFrame(Frame&& frame);
-  void deliver(Event event);
+  void deliver(Event event, bool counted);
+  // Accounts the buffered input of an unfinished frame and its deadline.
+  void noteUnfinishedInput();
+  // A request was answered or a message handled: below the bound, reading
+  // resumes.
+  void noteAnswered();
+  void resumeReading();
+  // Called by the deadline timer; true when the connection stays.
+  bool checkFrameDeadline(std::chrono::steady_clock::time_point now);
   // Closes the socket and delivers the final events. I/O thread only.
   // reason, when given, is logged: the peer misbehaved.
   void invalidate(std::optional<base::Error> reason);
@@ -135,7 +151,8 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   uint32_t watchedEventsLocked() const;
 
   // Constant after construction.
-  const int fd_;  // -1 when the connection never connected
+  const int fd_;         // -1 when the connection never connected
+  const bool accepted_;  // the server side: counted per user
   pid_t pid_ = -1;
   uid_t uid_ = static_cast<uid_t>(-1);
   gid_t gid_ = static_cast<gid_t>(-1);
@@ -143,6 +160,9 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
 
   // I/O thread only.
   FrameReader reader_;
+  size_t unfinishedBytes_ = 0;  // reader_'s bytes, as counted in unfinishedInput()
+  uint64_t framesSeen_ = 0;     // reader_.framesRead() when last accounted
+  std::optional<std::chrono::steady_clock::time_point> frameStarted_;
 
   std::atomic<uint64_t> nextId_{1};
 
@@ -161,6 +181,8 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   size_t outputOffset_ = 0;  // bytes of output_.front() already written
   size_t outputBytes_ = 0;   // unsent bytes in output_
   size_t outputLimit_ = kMaxPendingOutput;
+  size_t unanswered_ = 0;    // requests not yet answered, messages not yet handled
+  bool readPaused_ = false;  // unanswered_ reached kMaxUnansweredRequests
   std::unordered_map<uint64_t, PendingReply> pending_;
 };
 

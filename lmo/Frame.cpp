@@ -21,6 +21,8 @@ uint64_t getBE(const uint8_t* p, int bytes) {
 // Buffered bytes already handed out are dropped once they are at least this
 // many and at least half of the buffer, so compaction stays linear.
 constexpr size_t kCompactThreshold = 64 * 1024;
+// Buffer capacity kept between frames; more is released once drained.
+constexpr size_t kRetainedBufferBytes = 256 * 1024;
 
 }  // namespace
 
@@ -74,8 +76,15 @@ std::optional<base::Result<Frame>> FrameReader::next() {
     return frame;
   }
   consumed_ += kFrameLengthSize + length;
+  ++framesRead_;
   if (consumed_ == buffer_.size()) {
-    buffer_.clear();
+    // A large frame's buffer is given back rather than kept for the life of
+    // the connection: idle peers that once sent a big request hold nothing.
+    if (buffer_.capacity() > kRetainedBufferBytes) {
+      std::vector<uint8_t>().swap(buffer_);
+    } else {
+      buffer_.clear();
+    }
     consumed_ = 0;
   }
   return frame;

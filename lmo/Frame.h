@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "base/Result.h"
+#include "lmo/Limits.h"
 #include "lmo/Value.h"
 
 namespace vantrel::lmo {
@@ -22,8 +23,6 @@ namespace vantrel::lmo {
 inline constexpr uint8_t kFrameVersion = 1;
 inline constexpr size_t kFrameLengthSize = 4;
 inline constexpr size_t kFrameHeaderSize = 20;
-// The largest L (header plus body) a peer may send or receive.
-inline constexpr size_t kMaxFrameLength = 16 * 1024 * 1024;
 
 enum class FrameKind : uint8_t { kRequest = 1, kMessage = 2, kReply = 3 };
 
@@ -58,12 +57,17 @@ class FrameReader {
   // Bytes of an unfinished frame are buffered: a stream that ends now ends
   // in the middle of a frame.
   bool hasPartialFrame() const { return buffer_.size() > consumed_; }
+  // Bytes fed and not yet returned as frames.
+  size_t bufferedBytes() const { return buffer_.size() - consumed_; }
+  // Frames returned so far.
+  uint64_t framesRead() const { return framesRead_; }
 
  private:
   base::Result<Frame> parse(const uint8_t* p, size_t length) const;
 
   std::vector<uint8_t> buffer_;
   size_t consumed_ = 0;  // bytes of buffer_ already returned as frames
+  uint64_t framesRead_ = 0;
   std::optional<base::Error> error_;
 };
 

@@ -198,6 +198,24 @@ void Listener::acceptOne(int fd) {
     handler = handler_;
   }
   auto connection = Connection::fromAcceptedSocket(fd, targetQueue_);
+  // Root and this process's own user may use every slot; any other user
+  // leaves the reserve alone and holds at most its own share, so no one
+  // user can lock the others (or the administrator) out. A refused
+  // connection closes as it goes out of scope.
+  const uid_t uid = connection->uid();
+  if (uid != 0 && uid != ::geteuid()) {
+    const size_t open = Connection::openCount();
+    if (open > kMaxOpenConnections - kReservedConnections) {
+      base::vtlog("refusing a connection from uid %d: %u connections are open", uid, open - 1);
+      return;
+    }
+    const size_t mine = Connection::openCountForUser(uid);
+    if (mine > kMaxConnectionsPerUser) {
+      base::vtlog("refusing a connection from uid %d: %u connections of that user are open", uid,
+                  mine - 1);
+      return;
+    }
+  }
   targetQueue_->async(
       [handler = std::move(handler), connection = std::move(connection)] { handler(connection); });
 }

@@ -14,11 +14,9 @@
 #include "base/Result.h"
 #include "lmo/Connection.h"
 #include "lmo/IoLoop.h"
+#include "lmo/Limits.h"
 
 namespace vantrel::lmo {
-
-// Open connections beyond which new peers are accepted and closed at once.
-inline constexpr size_t kMaxOpenConnections = 4096;
 
 class Listener : public IoSource, public std::enable_shared_from_this<Listener> {
  public:

@@ -1,8 +1,11 @@
 #include <gtest/gtest.h>
 
+#include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -34,9 +37,9 @@ class Recorder {
     events_.push_back(std::move(what));
     changed_.notify_all();
   }
-  bool waitFor(size_t count) {
+  bool waitFor(size_t count, std::chrono::milliseconds timeout = 10s) {
     std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, 10s, [&] { return events_.size() >= count; });
+    return changed_.wait_for(lock, timeout, [&] { return events_.size() >= count; });
   }
   std::vector<std::string> events() const {
     std::lock_guard lock(mutex_);
@@ -85,6 +88,8 @@ class EchoServer {
     std::atomic<size_t> outputLimit{0};
     std::mutex mutex;
     std::vector<std::shared_ptr<Connection>> accepted;  // Guarded by mutex.
+    // Replies to {"hold": 1} requests, sent when the test releases them.
+    std::vector<std::pair<std::weak_ptr<Connection>, Reply>> held;  // Guarded by mutex.
   };
 
   explicit EchoServer(const std::string& path) : queue_(makeQueue("lmo-test")) {
@@ -113,6 +118,11 @@ class EchoServer {
         }
         if (auto reply = createReply(*m)) {
           reply->body = reply->body.setting("echo", Value(m->body()));
+          if (m->body().contains("hold")) {
+            std::lock_guard lock(state->mutex);
+            state->held.emplace_back(weak, std::move(*reply));
+            return;
+          }
           (void)connection->sendReply(*reply);
         }
       });
@@ -131,6 +141,18 @@ class EchoServer {
     return state_->accepted;
   }
   void setOutputLimit(size_t bytes) { state_->outputLimit = bytes; }
+  // Sends the replies held so far; returns how many.
+  size_t releaseHeld() {
+    std::vector<std::pair<std::weak_ptr<Connection>, Reply>> held;
+    {
+      std::lock_guard lock(state_->mutex);
+      held.swap(state_->held);
+    }
+    for (auto& [weak, reply] : held) {
+      if (auto connection = weak.lock()) (void)connection->sendReply(reply);
+    }
+    return held.size();
+  }
 
  private:
   std::shared_ptr<State> state_ = std::make_shared<State>();
@@ -392,6 +414,128 @@ TEST_F(ConnectionTest, TerminationImminentReachesHandlersAndChangesNothingElse) 
   EXPECT_NE(replies->events()[1], "connection invalid");
   c->cancel();
   ASSERT_TRUE(events->waitFor(2));
+}
+
+TEST_F(ConnectionTest, APipeliningPeerIsReadNoFurtherThanItsUnansweredRequests) {
+  // Three times the bound, in one write, none answered until released.
+  const size_t total = 3 * kMaxUnansweredRequests;
+  Bytes stream;
+  for (size_t i = 1; i <= total; ++i) {
+    Bytes frame = frameOf(FrameKind::kRequest, i, Dictionary{{"hold", Value::integer(1)}});
+    stream.insert(stream.end(), frame.begin(), frame.end());
+  }
+  int fd = rawConnect(path_);
+  ASSERT_EQ(::send(fd, stream.data(), stream.size(), MSG_NOSIGNAL),
+            static_cast<ssize_t>(stream.size()));
+  size_t delivered = 0;
+  while (delivered < total) {
+    ASSERT_TRUE(server_.serverEvents.waitFor(delivered + kMaxUnansweredRequests));
+    delivered += kMaxUnansweredRequests;
+    // Not one request more is read while all of those wait for replies.
+    EXPECT_FALSE(server_.serverEvents.waitFor(delivered + 1, 200ms)) << delivered;
+    EXPECT_EQ(server_.releaseHeld(), kMaxUnansweredRequests);
+  }
+  // Every request was answered, in order, and the connection stays.
+  FrameReader replies;
+  uint64_t answered = 0;
+  uint8_t buffer[4096];
+  while (answered < total) {
+    const ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+    ASSERT_GT(n, 0);
+    replies.feed(buffer, static_cast<size_t>(n));
+    while (auto frame = replies.next()) {
+      ASSERT_TRUE(frame->has_value());
+      EXPECT_EQ((*frame)->inReplyTo, ++answered);
+    }
+  }
+  EXPECT_EQ(server_.serverEvents.count("connection invalid"), 0u);
+  ::close(fd);
+}
+
+TEST_F(ConnectionTest, UnfinishedFramesAreBoundedInSizeAndTime) {
+  base::LogCapture log;
+  // Peers each half-way through a large frame: the one whose input passes
+  // the bound on all unfinished frames is dropped, the others stay.
+  const size_t share = kMaxFrameLength - 4 * 1024 * 1024;
+  const size_t peers = kMaxUnfinishedInput / share + 1;
+  Bytes header = {0x00, 0xF0, 0x00, 0x00};  // a frame of 15 MiB, of which share arrives
+  Bytes body(share - header.size(), 0);
+  std::vector<int> fds;
+  for (size_t i = 0; i < peers; ++i) {
+    fds.push_back(rawConnect(path_));
+    ASSERT_EQ(::send(fds.back(), header.data(), header.size(), MSG_NOSIGNAL), 4);
+    // The last peer's write may fail part-way: it is disconnected.
+    (void)::send(fds.back(), body.data(), body.size(), MSG_NOSIGNAL);
+  }
+  char byte;
+  EXPECT_EQ(::recv(fds.back(), &byte, 1, 0), 0);
+  EXPECT_EQ(::recv(fds.front(), &byte, 1, MSG_DONTWAIT), -1);  // still open
+  EXPECT_TRUE(log.contains("unfinished frames of all peers exceed"));
+  for (int fd : fds) ::close(fd);
+
+  // A peer that stops in the middle of a frame is dropped after the deadline.
+  int stalled = rawConnect(path_);
+  ASSERT_EQ(::send(stalled, header.data(), header.size(), MSG_NOSIGNAL), 4);
+  const auto start = std::chrono::steady_clock::now();
+  timeval wait{static_cast<time_t>(kFrameDeadline.count() + 5), 0};
+  ::setsockopt(stalled, SOL_SOCKET, SO_RCVTIMEO, &wait, sizeof wait);
+  EXPECT_EQ(::recv(stalled, &byte, 1, 0), 0);
+  EXPECT_GE(std::chrono::steady_clock::now() - start, kFrameDeadline);
+  EXPECT_TRUE(log.contains("frame not completed within " + std::to_string(kFrameDeadline.count()) +
+                           " seconds"));
+  ::close(stalled);
+}
+
+TEST_F(ConnectionTest, OneUserCannotTakeEveryConnection) {
+  base::LogCapture log;
+  ::chmod(dir_.path().c_str(), 0755);
+  const size_t extra = 4;
+  // A child of another user opens more than its share and counts the
+  // connections closed at once: its exit status. Everything it needs is
+  // made before the fork, so the child only makes system calls.
+  const size_t attempts = kMaxConnectionsPerUser + extra;
+  std::vector<pollfd> polled(attempts, pollfd{-1, POLLIN, 0});
+  const sockaddr_un addr = unixAddress(path_);
+  pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) {
+    rlimit files{};
+    ::getrlimit(RLIMIT_NOFILE, &files);
+    files.rlim_cur = files.rlim_max;
+    ::setrlimit(RLIMIT_NOFILE, &files);
+    if (::setgid(65534) != 0 || ::setuid(65534) != 0) ::_exit(100);
+    for (pollfd& p : polled) {
+      p.fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      if (::connect(p.fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) ::_exit(101);
+    }
+    // The refused ones are closed as they are accepted; two seconds is ample.
+    int closed = 0;
+    for (int round = 0; round < 20; ++round) {
+      if (::poll(polled.data(), polled.size(), 100) <= 0) continue;
+      for (pollfd& p : polled) {
+        char byte;
+        if (p.revents != 0 && ::recv(p.fd, &byte, 1, MSG_DONTWAIT) == 0) {
+          ++closed;
+          p.fd = -1;  // poll ignores it from now on
+        }
+      }
+    }
+    ::_exit(closed);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(static_cast<size_t>(WEXITSTATUS(status)), extra);
+  EXPECT_EQ(
+      log.count("refusing a connection from uid 65534: " + std::to_string(kMaxConnectionsPerUser) +
+                " connections of that user are open"),
+      extra);
+  // Root still connects.
+  auto replies = recorder();
+  auto c = connectRecorded(path_, recorder());
+  request(*c, Dictionary{{"after", Value::integer(1)}}, replies);
+  ASSERT_TRUE(replies->waitFor(1));
+  EXPECT_NE(replies->events()[0], "connection invalid");
 }
 
 }  // namespace
