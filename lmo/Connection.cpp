@@ -45,6 +45,20 @@ void countUser(uid_t uid, bool open) {
   }
 }
 
+std::vector<gid_t> peerGroups(int fd) {
+  std::vector<gid_t> groups(16);
+  for (int attempt = 0; attempt < 2; ++attempt) {
+    socklen_t len = static_cast<socklen_t>(groups.size() * sizeof(gid_t));
+    if (::getsockopt(fd, SOL_SOCKET, SO_PEERGROUPS, groups.data(), &len) == 0) {
+      groups.resize(len / sizeof(gid_t));
+      return groups;
+    }
+    if (errno != ERANGE) break;
+    groups.resize(len / sizeof(gid_t));  // the kernel said how many
+  }
+  return {};
+}
+
 int peerPidfd(int fd, pid_t pid) {
   int pidfd = -1;
   socklen_t len = sizeof pidfd;
@@ -132,7 +146,10 @@ Connection::Connection(int fd, QueuePtr targetQueue, bool accepted)
     gid_ = cred.gid;
   }
   pidfd_ = peerPidfd(fd_, pid_);
-  if (accepted_) countUser(uid_, true);
+  if (accepted_) {
+    groups_ = peerGroups(fd_);
+    countUser(uid_, true);
+  }
 }
 
 std::shared_ptr<Connection> Connection::connectToService(std::string_view name,

@@ -99,6 +99,9 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   pid_t pid() const { return pid_; }
   uid_t uid() const { return uid_; }
   gid_t gid() const { return gid_; }
+  // The peer's supplementary groups when it connected (SO_PEERGROUPS);
+  // empty when unknown.
+  const std::vector<gid_t>& groups() const { return groups_; }
   // A pidfd of the peer process (stands in for an audit token: it keeps
   // naming that process even if its pid is reused), or -1 when neither
   // SO_PEERPIDFD nor pidfd_open could provide one. Owned by the connection.
@@ -157,6 +160,7 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   uid_t uid_ = static_cast<uid_t>(-1);
   gid_t gid_ = static_cast<gid_t>(-1);
   int pidfd_ = -1;
+  std::vector<gid_t> groups_;
 
   // I/O thread only.
   FrameReader reader_;
