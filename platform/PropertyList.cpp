@@ -222,17 +222,14 @@ base::Result<PlistPtr> toNode(const Value& value, int depth);
 
 base::Result<PlistPtr> dateNode(const lmo::Date& date) {
   const double since2001 = date.secondsSince1970 - kSecondsFrom1970To2001;
-  double whole = std::floor(since2001);
-  long usec = std::lround((since2001 - whole) * 1e6);
-  if (usec >= 1000000) {
-    whole += 1;
-    usec = 0;
-  }
+  // Only XML is written, and XML keeps whole seconds: the fraction is
+  // dropped here, since libplist rounds the seconds it prints.
+  const double whole = std::floor(since2001);
   // libplist 2.2 takes the seconds as an int32_t.
   if (!std::isfinite(since2001) || whole <= INT32_MIN || whole > INT32_MAX) {
     return unrepresentable("date out of range");
   }
-  return PlistPtr(plist_new_date(static_cast<int32_t>(whole), static_cast<int32_t>(usec)));
+  return PlistPtr(plist_new_date(static_cast<int32_t>(whole), 0));
 }
 
 base::Result<PlistPtr> containerNode(const Value& value, int depth) {

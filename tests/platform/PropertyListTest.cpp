@@ -83,6 +83,13 @@ TEST(PropertyList, RoundTripsEveryTypeThroughXml) {
   ASSERT_TRUE(back.has_value()) << back.error().description();
   EXPECT_EQ(back.value(), value) << lmo::describe(back.value());
 
+  // XML keeps whole seconds: a fraction is dropped, however close to one.
+  for (const double fraction : {0.25, 0.9999999}) {
+    const double seconds = 1000000000 + fraction;
+    auto date = readPropertyList(writePropertyListXML(Value(lmo::Date{seconds})).value());
+    EXPECT_EQ(date.value(), Value(lmo::Date{1000000000})) << fraction;
+  }
+
   // A UUID has no property-list type: it travels as its canonical text.
   const base::Uuid uuid = base::Uuid::random();
   auto uuidBack = readPropertyList(writePropertyListXML(Value(uuid)).value());
@@ -181,7 +188,9 @@ TEST(PropertyList, RejectsMalformedInput) {
       {"binary lone surrogate", binary({"\x61\xD8\x00"})},
       {"binary 16-byte UID", binary({"\x8F" + std::string(16, '\0')})},
       // libplist hands these over as text that is not UTF-8.
-      {"binary ASCII high byte", binary({"\x53" "a\xE9" "b"})},
+      {"binary ASCII high byte", binary({"\x53"
+                                         "a\xE9"
+                                         "b"})},
       {"binary ASCII high byte key", binary({"\xD1\x01\x02", "\x52k\xFF", "\x09"})},
   };
   const Cases tooLarge = {
