@@ -161,7 +161,7 @@ void Transaction::explainPlugIn() {
       records.push_back(std::move(record));
     }
   } else if (path != nullptr) {
-    const std::optional<std::string> canonical = canonicalPath(*path->getIfString());
+    const std::optional<std::string> canonical = canonicalPath(*path->getIfString(), *connection());
     if (!canonical) {
       replyWith(notFound(protocol::kReasonNotInstalled,
                          base::format("nothing is installed at %@", *path->getIfString())));

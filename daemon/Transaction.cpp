@@ -13,6 +13,7 @@
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
 #include "lmo/Protocol.h"
+#include "platform/PeerPaths.h"
 #include "platform/Probes.h"
 
 namespace vantrel::daemon {
@@ -48,13 +49,10 @@ constexpr Operation kDispatchTable[] = {
 
 }  // namespace
 
-std::optional<std::string> canonicalPath(const std::string& path) {
-  if (path.find('\0') != std::string::npos) return std::nullopt;
-  std::unique_ptr<char, decltype(&std::free)> resolved(::realpath(path.c_str(), nullptr),
-                                                       &std::free);
-  if (!resolved) return std::nullopt;
-  std::string canonical(resolved.get());
-  if (canonical.size() >= kMaxCanonicalPathBytes) return std::nullopt;
+std::optional<std::string> canonicalPath(const std::string& path, const lmo::Connection& peer) {
+  const platform::LookupCredentials who{peer.uid(), peer.gid(), peer.groups()};
+  std::optional<std::string> canonical = platform::canonicalPathFor(path, who);
+  if (canonical && canonical->size() >= kMaxCanonicalPathBytes) return std::nullopt;
   return canonical;
 }
 
@@ -175,7 +173,7 @@ bool Transaction::marshalPaths(const PathBlock& block) {
                   base::format("absolute path required: %s", path->c_str()));
       return false;
     }
-    const std::optional<std::string> canonical = canonicalPath(*path);
+    const std::optional<std::string> canonical = canonicalPath(*path, *connection());
     if (!block(canonical.value_or(*path), canonical.has_value())) return false;
   }
   return true;

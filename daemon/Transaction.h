@@ -30,9 +30,13 @@ struct MatchState;
 struct MatchHost;
 enum class FormDetail;
 
-// The canonical form of an absolute path, or nullopt when it does not exist,
-// cannot be resolved, holds a NUL byte or resolves to something too long.
-std::optional<std::string> canonicalPath(const std::string& path);
+// The canonical form of an absolute path a peer sent, resolved with the
+// peer's right to look (its user and groups: see platform/PeerPaths.h), or
+// nullopt when it does not exist, needs a directory the peer may not
+// search, cannot be resolved, holds a NUL byte or resolves to something too
+// long. The daemon could look anywhere; answering by what it found there
+// would tell the peer what exists where the peer cannot look.
+std::optional<std::string> canonicalPath(const std::string& path, const lmo::Connection& peer);
 
 class Transaction : public std::enable_shared_from_this<Transaction> {
  public:

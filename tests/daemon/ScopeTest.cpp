@@ -61,6 +61,23 @@ TEST_F(Scope, AnotherUserMayDiscoverButNotChangeState) {
       {std::to_string(protocol::bits(protocol::HoldFlags::kPlugIn)), plugInPath("widget")});
   EXPECT_EQ(hold, peerError(protocol::kErrorAccessDenied, "request \"lock" + refusedTail));
   EXPECT_EQ(server_->holds().size(), 0u);
+
+  // Paths are looked up with the other user's rights: behind a directory it
+  // may not search, a registered bundle and nothing at all answer alike.
+  const std::string bundle = plugInPath("widget");
+  const std::string parent = bundle.substr(0, bundle.rfind('/'));
+  ASSERT_EQ(::chmod(parent.c_str(), 0700), 0);
+  for (const std::string& path : {bundle, parent + "/Nothing.appex"}) {
+    EXPECT_EQ(
+        askAsOtherUser(peer, "explain", {path}),
+        "ok " + std::string(protocol::kReasonNotInstalled) + " nothing is installed at " + path)
+        << path;
+  }
+  // Once it may look, it finds the registration.
+  ASSERT_EQ(::chmod(parent.c_str(), 0755), 0);
+  const std::string found = askAsOtherUser(peer, "explain", {bundle});
+  EXPECT_TRUE(found.starts_with("ok ")) << found;
+  EXPECT_EQ(found.find(protocol::kReasonNotInstalled), std::string::npos) << found;
 }
 
 }  // namespace

@@ -25,6 +25,10 @@
 //              "error <code> <message>"; then blocks until standard input
 //              closes (what the request set up for this process, such as an
 //              enabled plug-in, lasts as long as it runs); exit 0.
+//   explain <service> <path>
+//              asks "explain" about the bundle at path and writes "ok
+//              <reason> <text>" (the reply's "reason" and "text") or "error
+//              <code> <message>"; exit 0.
 //   read-token <token> <name>
 //              consumes the file-access token as a host does, opens name
 //              relative to the directory it opens and writes the file's
@@ -178,6 +182,26 @@ int requestAndWait(const char* service, const char* type, uint64_t flags,
   return blockUntilStdinCloses();
 }
 
+int explainPath(const char* service, const char* path) {
+  auto client = VTDaemonClient::initWithServiceName(service);
+  const auto message = client->request(protocol::kRequestExplain)
+                           .setting(protocol::kKeyPath, vantrel::lmo::Value(path));
+  auto outcome = client->sendSync(message, kReplyTimeout);
+  if (auto failure = transportFailure(outcome)) {
+    printError(*failure);
+    return kConnectionFailedExit;
+  }
+  if (auto refused = VTDaemonClient::errorInReply(outcome.value())) {
+    printError(*refused);
+    return 0;
+  }
+  const vantrel::lmo::Dictionary& body = outcome.value().message()->body();
+  const std::string* reason = body.get(protocol::kKeyReason).getIfString();
+  const std::string* text = body.get(protocol::kKeyText).getIfString();
+  printLine("ok " + (reason ? *reason : "-") + " " + (text ? *text : "-"));
+  return 0;
+}
+
 int readThroughToken(const std::string& token, const char* name) {
   namespace platform = vantrel::platform;
   const auto fail = [] {
@@ -234,6 +258,7 @@ int main(int argc, char** argv) {
   if (argc == 2 && mode == "print-pid") return printPid();
   if (argc == 3 && mode == "connect") return connectAndWait(argv[2]);
   if (argc == 4 && mode == "read-token") return readThroughToken(argv[2], argv[3]);
+  if (argc == 4 && mode == "explain") return explainPath(argv[2], argv[3]);
   if (argc >= 4 && mode == "hold") {
     if (auto flags = parseFlags(argv[3])) {
       return holdAndWait(argv[2], *flags, std::vector<std::string>(argv + 4, argv + argc));
