@@ -63,7 +63,9 @@ std::optional<std::string> canonicalPathFor(const std::string& path, const Looku
       resolved = parentOf(resolved);
       continue;
     }
-    const std::string next = resolved == "/" ? "/" + component : resolved + "/" + component;
+    std::string next = resolved;
+    if (next.back() != '/') next += '/';
+    next += component;
     struct stat st {};
     if (::lstat(next.c_str(), &st) != 0) return std::nullopt;
     if (S_ISLNK(st.st_mode)) {
@@ -72,7 +74,7 @@ std::optional<std::string> canonicalPathFor(const std::string& path, const Looku
       const ssize_t n = ::readlink(next.c_str(), target.data(), target.size());
       if (n <= 0 || static_cast<size_t>(n) > target.size()) return std::nullopt;
       target.resize(static_cast<size_t>(n));
-      if (target.front() == '/') resolved = "/";
+      if (target.front() == '/') resolved.assign(1, '/');
       pushComponents(target, pending, true);
       continue;
     }
