@@ -92,8 +92,8 @@ base::Result<void> ConsentStore::prepare() {
                                      "the privacy-consent table needs version %d",
                                      path_, *found, kStoreSchemaVersion));
   }
-  // Per connection; the database's write-ahead log mode is already set.
-  if (sqlite3_exec(db_, "PRAGMA synchronous=NORMAL", nullptr, nullptr, nullptr) != SQLITE_OK ||
+  // FULL (per connection, WAL already set): an acknowledged revocation must survive power loss.
+  if (sqlite3_exec(db_, "PRAGMA synchronous=FULL", nullptr, nullptr, nullptr) != SQLITE_OK ||
       sqlite3_exec(db_, kCreateTable, nullptr, nullptr, nullptr) != SQLITE_OK) {
     return failure("cannot create");
   }

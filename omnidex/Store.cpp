@@ -117,8 +117,11 @@ base::Result<void> Store::prepare() {
   }
   // WAL lets readers of the file (tools, a second look at a crash) proceed
   // while the daemon writes; NORMAL syncs at checkpoints rather than at every
-  // commit, which is what makes a 1,000-bundle reconciliation cheap. A crash
-  // may lose the last commits but never corrupts the file.
+  // commit, which is what makes a 1,000-bundle reconciliation cheap. A power
+  // loss may lose the last commits but never corrupts the file, and what it
+  // loses in the watched directories the next reconciliation reads again.
+  // (The consent table's connection, whose answers cannot be read again from
+  // anywhere, syncs each commit.)
   if (sqlite3_exec(db_, "PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL", nullptr, nullptr,
                    nullptr) != SQLITE_OK) {
     return failure("cannot open");

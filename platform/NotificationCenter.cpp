@@ -2,10 +2,13 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <charconv>
+#include <mutex>
+#include <set>
 #include <string>
 
 #include "platform/AtomicFile.h"
@@ -44,6 +47,30 @@ uint64_t readCounter(const std::string& path) {
   return value;
 }
 
+// Creates the lock file with exactly kFileMode when it is missing: FileLock
+// would create it with the mode less the umask.
+int createLockFile(const std::string& path) {
+  const int fd =
+      ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, kFileMode);
+  if (fd < 0) return errno == EEXIST ? 0 : errno;
+  const int err = ::fchmod(fd, kFileMode) == 0 ? 0 : errno;
+  ::close(fd);
+  return err;
+}
+
+// The notification center starts in a directory with this process's first
+// post there: the counters' temporaries that interrupted posts left behind
+// are removed then. Called under the directory's lock, so no other process is
+// posting; the atomic writer spares this process's own writes in progress.
+void startIn(const std::string& dir) {
+  static std::mutex mutex;
+  static std::set<std::string>* started = new std::set<std::string>;
+  std::lock_guard lock(mutex);
+  if (!started->insert(dir).second) return;
+  // Best effort: what cannot be removed now is tried again at the next start.
+  (void)removeStaleTemporaryFiles(dir);
+}
+
 }  // namespace
 
 std::string notificationDirectory() {
@@ -59,8 +86,10 @@ base::Result<uint64_t> postNotification(std::string_view name) {
     return made.error();
   }
   const std::string lockPath = dir + "/" + kLockFileName;
+  if (int err = createLockFile(lockPath)) return posixError(err, "cannot create", lockPath);
   FileLock lock;
   if (int err = lock.lockFile(lockPath, kFileMode)) return posixError(err, "cannot lock", lockPath);
+  startIn(dir);
 
   const std::string path = dir + "/" + std::string(name);
   const uint64_t next = readCounter(path) + 1;

@@ -12,8 +12,8 @@
 
 namespace vantrel::platform {
 
-// Longest notification name. The counter file is replaced through a temporary
-// named ".<name>.XXXXXX", which must still fit in NAME_MAX (255).
+// Longest notification name: one file name, with room to spare in NAME_MAX
+// (255) for the atomic writer's temporaries beside it.
 inline constexpr size_t kMaxNotificationNameLength = 240;
 
 // <runtimeDirectory()>/notify: where the counter files live.
@@ -23,7 +23,9 @@ std::string notificationDirectory();
 // <runtimeDirectory()>/notify/<name> with the next value of a 64-bit counter
 // (decimal text + newline), so any process can watch it with inotify.
 // Returns the new counter value. Posts from several threads or processes are
-// serialised by an flock on <notify>/.lock and never lose an increment.
+// serialised by an flock on <notify>/.lock and never lose an increment. A
+// process's first post into a directory removes the temporaries that posts
+// interrupted by a crash or a kill left there.
 // Errors: the name is not a valid single path component (empty, ".", "..",
 // contains '/' or NUL, or longer than kMaxNotificationNameLength): domain
 // "POSIX", EINVAL; or I/O: domain "POSIX" with the errno. On error the counter

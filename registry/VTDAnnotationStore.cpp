@@ -75,6 +75,7 @@ std::shared_ptr<VTDAnnotationStore> VTDAnnotationStore::initWithDatabase(
     std::optional<std::string> path) {
   auto store = std::make_shared<VTDAnnotationStore>();
   store->annotationsURL_ = path ? model::FileUrl::fromPath(*path) : defaultDatabaseURL();
+  store->removeInterruptedSaves();
   base::Error error;
   if (!store->loadDb(&error)) {
     if (error.code != kFileNotFoundErrorCode) {
@@ -84,6 +85,20 @@ std::shared_ptr<VTDAnnotationStore> VTDAnnotationStore::initWithDatabase(
     store->setAnnotations(Dictionary());
   }
   return store;
+}
+
+void VTDAnnotationStore::removeInterruptedSaves() const {
+  const std::string& file = annotationsURL_.path();
+  const size_t slash = file.rfind('/');
+  const std::string directory = slash == std::string::npos ? "."
+                                : slash == 0               ? "/"
+                                                           : file.substr(0, slash);
+  const std::string name = slash == std::string::npos ? file : file.substr(slash + 1);
+  if (name.empty()) return;
+  // Best effort, and silent: a directory that cannot be read (with -d, it
+  // may not exist yet) holds nothing to remove, and whatever is left is
+  // tried again at the next start.
+  (void)platform::removeStaleTemporaryFiles(directory, name);
 }
 
 bool VTDAnnotationStore::loadDb(base::Error* error) {

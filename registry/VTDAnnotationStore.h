@@ -47,9 +47,11 @@ class VTDAnnotationStore {
 
   // A store over the file at path (used as the file itself; its directory is
   // neither made nor required), or over defaultDatabaseURL() for nullopt,
-  // loaded now. A file that cannot be loaded leaves the table empty; unless
-  // it is simply missing, "unable to load annotation database:%@ error:%@
-  // (resetting)" is logged, and the next save replaces it. Never null.
+  // loaded now, after removing the temporary files that saves interrupted by
+  // a crash or a kill left beside it. A file that cannot be loaded leaves the
+  // table empty; unless it is simply missing, "unable to load annotation
+  // database:%@ error:%@ (resetting)" is logged, and the next save replaces
+  // it. Never null.
   static std::shared_ptr<VTDAnnotationStore> initWithDatabase(std::optional<std::string> path);
 
   // The annotation stored under key; null when there is none or it is not a
@@ -81,6 +83,9 @@ class VTDAnnotationStore {
   void setAnnotations(lmo::Dictionary table);
 
  private:
+  // Removes the atomic writer's stale temporaries of the annotation file.
+  void removeInterruptedSaves() const;
+
   // Constant once the store is shared.
   model::FileUrl annotationsURL_ = model::FileUrl::fromPath("");
 

@@ -11,6 +11,7 @@
 #include <thread>
 #include <vector>
 
+#include "platform/AtomicFile.h"
 #include "tests/platform/Helpers.h"
 
 namespace vantrel::platform {
@@ -39,6 +40,31 @@ TEST_F(NotificationCenterTest, PostsCountPerNameAndAreSeenByInotify) {
   ::close(inotify);
   ASSERT_GT(n, 0);
   EXPECT_STREQ(reinterpret_cast<const inotify_event*>(buffer)->name, "a");
+}
+
+TEST_F(NotificationCenterTest, MakesDirectoryAndFilesWithTheirModes) {
+  const mode_t saved = ::umask(077);
+  const auto posted = postNotification("a");
+  ::umask(saved);
+  ASSERT_EQ(posted.value(), 1u);
+  for (const auto& [file, mode] :
+       {std::pair{"notify", 0755u}, {"notify/a", 0644u}, {"notify/.lock", 0644u}}) {
+    EXPECT_EQ(modeOf(dir_.file(file)), mode) << file;
+  }
+}
+
+TEST_F(NotificationCenterTest, StartsByRemovingTheTemporariesOfInterruptedPosts) {
+  const pid_t dead = ::fork();
+  if (dead == 0) ::_exit(0);
+  ::waitpid(dead, nullptr, 0);
+  const std::string marker(kTemporaryFileMarker);
+  const std::string stale[] = {"notify/.a" + marker + std::to_string(dead) + "-4",
+                               "notify/.b" + marker + std::to_string(::getpid()) + "-999999"};
+  for (const std::string& name : stale) dir_.write(name, "7");
+  ASSERT_EQ(postNotification("a").value(), 1u);
+  for (const std::string& name : stale) {
+    EXPECT_FALSE(std::filesystem::exists(dir_.file(name))) << name;
+  }
 }
 
 TEST_F(NotificationCenterTest, RefusesNamesThatAreNotOneFileName) {

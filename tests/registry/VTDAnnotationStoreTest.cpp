@@ -2,10 +2,12 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <filesystem>
 
 #include "base/Log.h"
+#include "platform/AtomicFile.h"
 #include "platform/PropertyList.h"
 #include "tests/registry/RegistryFixtures.h"
 
@@ -80,6 +82,26 @@ TEST_F(VTDAnnotationStoreTest, MergeRemoveSharedKeysAndFailedSave) {
   EXPECT_EQ(store->annotationForPlugIn(*a_), election(3));
   ASSERT_EQ(log.lines().size(), 1u);
   EXPECT_TRUE(log.lines()[0].starts_with("unable to save annotations:file://" + path + " error:"));
+}
+
+TEST_F(VTDAnnotationStoreTest, OpeningRemovesTheTemporariesOfInterruptedSaves) {
+  // This process's own, which no save in progress uses, as a crashed daemon
+  // with this pid would have left them; and another file's, which stays.
+  const std::string temporary = "." + std::string("Annotations") +
+                                std::string(platform::kTemporaryFileMarker) +
+                                std::to_string(::getpid()) + "-999999";
+  const std::string othersTemporary = ".Other" + std::string(platform::kTemporaryFileMarker) +
+                                      std::to_string(::getpid()) + "-999999";
+  tmp_.write(temporary, "<plist");
+  tmp_.write(othersTemporary, "<plist");
+  auto store = VTDAnnotationStore::initWithDatabase(file());
+  EXPECT_FALSE(std::filesystem::exists(tmp_.file(temporary)));
+  EXPECT_TRUE(std::filesystem::exists(tmp_.file(othersTemporary)));
+  const mode_t saved = ::umask(0);
+  store->setAnnotation(election(1), *a_);
+  ::umask(saved);
+  struct stat st {};
+  EXPECT_TRUE(::stat(file().c_str(), &st) == 0 && (st.st_mode & 07777) == 0600);
 }
 
 TEST_F(VTDAnnotationStoreTest, DefaultLocation) {
