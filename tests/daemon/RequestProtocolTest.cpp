@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
 
 #include "base/Log.h"
@@ -113,6 +114,36 @@ TEST_F(RequestProtocol, PathsAreDecodedAndCanonicalised) {
   EXPECT_EQ(log.count("bulk options 0x1f not supported"), 0u);
   request(protocol::kRequestBulk, {{protocol::kKeyFlags, u64(0x1F)}});
   EXPECT_EQ(log.count("bulk options 0x1f not supported"), 1u);
+}
+
+TEST_F(RequestProtocol, CanonicalPathsOfUpTo1023BytesAreAccepted) {
+  const std::string top = std::filesystem::canonical(tmp_.path()).string();
+  // A plug-in bundle whose canonical path is exactly length bytes long.
+  const auto bundleOfLength = [&](size_t length) {
+    const std::string head = "/edge" + std::to_string(length), tail = "/P.plugin";
+    std::string path = top + head;
+    for (size_t left = length - path.size() - tail.size(); left > 0;) {
+      size_t part = std::min<size_t>(left, 200);
+      if (left - part == 1) --part;  // a component takes at least two bytes
+      path += "/" + std::string(part - 1, 'x');
+      left -= part;
+    }
+    path += tail;
+    EXPECT_EQ(path.size(), length);
+    writePlugIn(path.substr(top.size() + 1), "com.x.edge" + std::to_string(length));
+    return path;
+  };
+  const std::string fits = bundleOfLength(1023), tooLong = bundleOfLength(1024);
+  const std::pair<std::string, Expected> cases[] = {
+      {fits, {0, ""}},
+      {tooLong, {protocol::kErrorBadPath, "invalid plugin path: " + tooLong}},
+  };
+  for (const auto& [path, expected] : cases) {
+    EXPECT_EQ(errorOf(request(protocol::kRequestAdd, {{protocol::kKeyPaths, Array{path}}})),
+              expected)
+        << path.size();
+  }
+  EXPECT_NE(registry_->plugInForUrl(fits), nullptr);
 }
 
 TEST_F(RequestProtocol, UninstallWithdrawsServiceRegistrations) {

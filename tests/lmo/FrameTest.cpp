@@ -139,5 +139,35 @@ TEST(FrameTest, EncoderRefusesFramesPeersWouldRefuse) {
   EXPECT_EQ(drain(reader).size(), 1u);
 }
 
+TEST(FrameTest, TheLongestFrameIsReadAndOneByteMoreIsRefused) {
+  // {"data": <bytes>}: the header, a map head, the key (one byte of head and
+  // four of text) and a byte string's five-byte head.
+  constexpr size_t kBodyOverhead = 1 + 5 + 5;
+  const Frame longest{
+      FrameKind::kMessage, 1, 0,
+      Dictionary{
+          {"data", Value::data(Bytes(kMaxFrameLength - kFrameHeaderSize - kBodyOverhead, 0x5A))}}};
+  Bytes bytes = frameBytes(longest);
+  ASSERT_EQ(bytes.size(), kFrameLengthSize + kMaxFrameLength);
+  Bytes tooLong = bytes;
+  tooLong[kFrameLengthSize - 1] += 1;  // the length prefix, one more
+  tooLong.push_back(0);
+  const std::pair<Bytes*, bool> cases[] = {{&bytes, true}, {&tooLong, false}};
+  for (const auto& [stream, read] : cases) {
+    FrameReader reader;
+    reader.feed(stream->data(), stream->size());
+    auto frame = reader.next();
+    ASSERT_TRUE(frame.has_value()) << read;
+    ASSERT_EQ(frame->has_value(), read);
+    if (read) {
+      EXPECT_EQ(frame->value().body, longest.body);
+    }
+  }
+  Frame oneMore = longest;
+  oneMore.body = Dictionary{
+      {"data", Value::data(Bytes(kMaxFrameLength - kFrameHeaderSize - kBodyOverhead + 1, 0))}};
+  EXPECT_FALSE(encodeFrame(oneMore).has_value());
+}
+
 }  // namespace
 }  // namespace vantrel::lmo

@@ -84,6 +84,11 @@ TEST(ActivationRules, CountsMaxItemsAndConformance) {
        {rule({{"public.jpeg", n(1)}}), items({{"public.image"}}), kUnmatchedAttachment},
        // One JPEG counts against both types.
        {rule({{"public.image", n(1)}, {"public.jpeg", n(2)}}), jpegs(2), kCountExceeded},
+       {rule({{"public.image", n(2)}, {"public.jpeg", n(1)}}), jpegs(2), kCountExceeded},
+       {rule({{"public.image", n(2)}, {"public.jpeg", n(1)}}),
+        items({{"public.jpeg"}, {"public.jpeg"}}), kCountExceeded},
+       {rule({{"public.image", n(2)}, {"public.jpeg", n(1)}}),
+        items({{"public.jpeg", "public.png"}}), kAdmitted},
        {rule({{"public.image", n(0)}}), jpegs(1), kCountExceeded},
        {rule({{"public.image", n(0)}}), items({{}}), kAdmitted},
        {rule({{"com.example.x", n(1)}}), items({{"com.example.x"}}), kAdmitted},

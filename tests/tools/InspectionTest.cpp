@@ -15,7 +15,8 @@ namespace {
 class InspectionTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    examples_ = (testing::sourceDir() / "examples").string();
+    // Fixed at build time, so the binary runs from any working directory.
+    examples_ = VANTREL_EXAMPLES_DIR;
     setenv("VANTREL_SDK_DIRS", (examples_ + "/sdks").c_str(), 1);
   }
   void TearDown() override { unsetenv("VANTREL_SDK_DIRS"); }
