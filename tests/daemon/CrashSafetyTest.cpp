@@ -28,6 +28,7 @@
 #include "registry/VTDAnnotationStore.h"
 #include "tests/omnidex/OmnidexFixtures.h"
 #include "tests/support/PeerProcess.h"
+#include "tests/support/RawClient.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::daemon {
@@ -47,59 +48,7 @@ std::string identifierOf(int plugIn) {
 
 // One blocking connection: a request out, its reply back. Any failure (the
 // daemon was killed) leaves it unusable and every later call null.
-class Client {
- public:
-  explicit Client(const std::string& socket)
-      : fd_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    socket.copy(addr.sun_path, sizeof addr.sun_path - 1);
-    const timeval timeout{30, 0};
-    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
-    if (::connect(fd_, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) close();
-  }
-  ~Client() { close(); }
-  Client(const Client&) = delete;
-  Client& operator=(const Client&) = delete;
-
-  bool connected() const { return fd_ >= 0; }
-
-  std::optional<Dictionary> call(const char* type, Dictionary extras = {}) {
-    Dictionary body =
-        extras.setting(protocol::kKeyRequest, type)
-            .setting(protocol::kKeyVersion, Value::unsignedInteger(protocol::kCurrentVersion));
-    const auto bytes = lmo::encodeFrame({lmo::FrameKind::kRequest, ++id_, 0, body});
-    if (fd_ < 0 || !bytes.has_value() ||
-        ::send(fd_, bytes.value().data(), bytes.value().size(), MSG_NOSIGNAL) !=
-            ssize_t(bytes.value().size())) {
-      close();
-      return std::nullopt;
-    }
-    for (;;) {
-      if (auto frame = reader_.next()) {
-        if (!frame->has_value()) break;
-        return std::move(frame->value().body);
-      }
-      uint8_t buffer[4096];
-      const ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) break;
-      reader_.feed(buffer, static_cast<size_t>(n));
-    }
-    close();
-    return std::nullopt;
-  }
-
- private:
-  void close() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
-  }
-
-  int fd_;
-  uint64_t id_ = 0;
-  lmo::FrameReader reader_;
-};
+using Client = vantrel::testing::RawClient;
 
 int64_t electionOf(const std::map<std::string, int64_t>& elections, const std::string& identifier) {
   const auto found = elections.find(identifier);

@@ -31,6 +31,7 @@
 #include "lmo/Protocol.h"
 #include "lmo/Value.h"
 #include "tests/support/PeerProcess.h"
+#include "tests/support/RawClient.h"
 #include "tests/support/TempDir.h"
 
 namespace vantrel::daemon {
@@ -147,86 +148,41 @@ int bindSocket(const std::string& path) {
   return -1;
 }
 
-// A plain socket to the daemon: frames (or garbage) out, frames back. A read
-// gives up after kDeadline.
-class RawClient {
- public:
-  explicit RawClient(const std::string& path)
-      : fd_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-    const sockaddr_un addr = socketAddress(path);
-    const timeval timeout{std::chrono::seconds(kDeadline).count(), 0};
-    ::setsockopt(fd_, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
-    if (::connect(fd_, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) close();
-  }
-  ~RawClient() { close(); }
-  RawClient(const RawClient&) = delete;
-  RawClient& operator=(const RawClient&) = delete;
+using vantrel::testing::RawClient;
 
-  bool connected() const { return fd_ >= 0; }
-  bool write(const Bytes& bytes) {
-    return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == ssize_t(bytes.size());
-  }
-  bool send(FrameKind kind, uint64_t id, const Dictionary& body) {
-    return write(lmo::encodeFrame({kind, id, 0, body}).value());
-  }
+// The next frame from the daemon (a read gives up after kDeadline); a bad
+// frame fails the test.
+std::optional<lmo::Frame> nextFrame(RawClient& client) {
+  std::optional<base::Result<lmo::Frame>> frame = client.readFrame();
+  if (!frame) return std::nullopt;
+  if (frame->has_value()) return std::move(*frame).value();
+  ADD_FAILURE() << "bad frame from the daemon: " << frame->error().description();
+  return std::nullopt;
+}
 
-  // The next frame; nullopt at end of stream, on a bad frame or when none
-  // comes in time.
-  std::optional<lmo::Frame> readFrame() {
-    for (;;) {
-      if (auto frame = reader_.next()) {
-        if (frame->has_value()) return std::move(*frame).value();
-        ADD_FAILURE() << "bad frame from the daemon: " << frame->error().description();
-        return std::nullopt;
-      }
-      uint8_t buffer[4096];
-      const ssize_t n = receive(buffer, sizeof buffer);
-      if (n <= 0) return std::nullopt;
-      reader_.feed(buffer, static_cast<size_t>(n));
-    }
-  }
+// Whether the daemon ends the connection (end of stream or reset) in time
+// without sending anything first.
+::testing::AssertionResult closedByDaemon(RawClient& client) {
+  uint8_t buffer[4096];
+  const ssize_t n = client.receive(buffer, sizeof buffer);
+  if (n == 0 || (n < 0 && errno == ECONNRESET)) return ::testing::AssertionSuccess();
+  if (n > 0) return ::testing::AssertionFailure() << "the daemon answered " << n << " bytes";
+  return ::testing::AssertionFailure() << "connection still open: " << std::strerror(errno);
+}
 
-  // Whether the daemon ends the connection (end of stream or reset) in time
-  // without sending anything first.
-  ::testing::AssertionResult closedByDaemon() {
-    uint8_t buffer[4096];
-    const ssize_t n = receive(buffer, sizeof buffer);
-    if (n == 0 || (n < 0 && errno == ECONNRESET)) return ::testing::AssertionSuccess();
-    if (n > 0) return ::testing::AssertionFailure() << "the daemon answered " << n << " bytes";
-    return ::testing::AssertionFailure() << "connection still open: " << std::strerror(errno);
-  }
-
-  // Whether the daemon has ended its side in time (for a socket that no
-  // longer reads).
-  bool hungUpByDaemon() {
-    pollfd p{fd_, POLLHUP, 0};
-    return eventually([&] { return ::poll(&p, 1, 0) == 1 && (p.revents & POLLHUP) != 0; });
-  }
-
-  void shutdown(int how) { ::shutdown(fd_, how); }
-  void close() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
-  }
-
- private:
-  ssize_t receive(uint8_t* buffer, size_t size) {
-    ssize_t n;
-    while ((n = ::recv(fd_, buffer, size, 0)) < 0 && errno == EINTR) {
-    }
-    return n;
-  }
-
-  int fd_;
-  lmo::FrameReader reader_;
-};
+// Whether the daemon has ended its side in time (for a socket that no longer
+// reads).
+bool hungUpByDaemon(const RawClient& client) {
+  pollfd p{client.fd(), POLLHUP, 0};
+  return eventually([&] { return ::poll(&p, 1, 0) == 1 && (p.revents & POLLHUP) != 0; });
+}
 
 // An unknown request type, answered with code 4: proof that the daemon
 // serves this connection, and a request that logs nothing at verbosity 0.
 ::testing::AssertionResult ping(RawClient& client, uint64_t id) {
   std::optional<lmo::Frame> reply;
   if (client.send(FrameKind::kRequest, id, request("ping", protocol::kCurrentVersion)))
-    reply = client.readFrame();
+    reply = nextFrame(client);
   if (!reply) return ::testing::AssertionFailure() << "no reply to ping " << id;
   if (reply->kind != FrameKind::kReply || reply->inReplyTo != id ||
       reply->body.get(protocol::kKeyErrorCode).getIfUInt64() !=
@@ -259,7 +215,7 @@ std::unique_ptr<RawClient> connectWhenUp(const std::string& socket, Daemon& daem
   if (!daemon.process) return nullptr;
   std::unique_ptr<RawClient> client;
   eventually([&] {
-    client = std::make_unique<RawClient>(socket);
+    client = std::make_unique<RawClient>(socket, kDeadline);
     return client->connected() || exitStatus(*daemon.process, 0ms).has_value();
   });
   if (client->connected()) return client;
@@ -370,7 +326,7 @@ TEST_F(VantreldProcess, ReplacesAStaleSocketButNeverALiveOneOrAFile) {
   ASSERT_EQ(::stat(socket_.c_str(), &after), 0);
   EXPECT_EQ(after.st_ino, before.st_ino);
   // Still served, by the first daemon: the others have exited.
-  RawClient client(socket_);
+  RawClient client(socket_, kDeadline);
   EXPECT_TRUE(ping(client, 2));
 }
 
@@ -422,15 +378,15 @@ TEST_F(VantreldProcess, ServesWellFormedFramesAndDropsMalformedPeers) {
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
     const size_t linesBefore = logLines(daemon.log).size();
-    RawClient bad(socket_);
+    RawClient bad(socket_, kDeadline);
     ASSERT_TRUE(bad.write(c.bytes));
     if (c.closeAfterWriting) bad.shutdown(SHUT_WR);
     if (c.reason == nullptr) {
-      const std::optional<lmo::Frame> reply = bad.readFrame();
+      const std::optional<lmo::Frame> reply = nextFrame(bad);
       ASSERT_TRUE(reply.has_value());
       EXPECT_EQ(reply->inReplyTo, 1u);
     } else {
-      EXPECT_TRUE(bad.closedByDaemon());
+      EXPECT_TRUE(closedByDaemon(bad));
       EXPECT_TRUE(eventually([&] { return logLines(daemon.log).size() > linesBefore; }));
     }
     ASSERT_TRUE(ping(*daemon.client, ++pingId)) << readFile(daemon.log);
@@ -449,18 +405,18 @@ TEST_F(VantreldProcess, SurvivesBrokenPipes) {
   uint64_t id = 10;
   for (const bool stopReading : {false, true}) {
     SCOPED_TRACE(stopReading ? "stops reading" : "closes");
-    RawClient client(socket_);
+    RawClient client(socket_, kDeadline);
     ASSERT_TRUE(client.send(FrameKind::kRequest, ++id,
                             request(protocol::kRequestBulk, protocol::kCurrentVersion)));
     if (stopReading) {
       // The socket stays open but refuses input: the reply's write fails
       // with a broken pipe, and the daemon drops the connection.
       client.shutdown(SHUT_RD);
-      EXPECT_TRUE(client.hungUpByDaemon());
+      EXPECT_TRUE(hungUpByDaemon(client));
     } else {
       client.close();
     }
-    RawClient next(socket_);
+    RawClient next(socket_, kDeadline);
     ASSERT_TRUE(ping(next, ++id)) << readFile(daemon.log);
   }
   // A peer that leaves is no misbehaving peer.
@@ -479,7 +435,7 @@ TEST_F(VantreldProcess, SurvivesBrokenPipes) {
   ASSERT_TRUE(unlogged.client);
   ASSERT_TRUE(unlogged.client->send(FrameKind::kRequest, 2,
                                     request(protocol::kRequestBulk, protocol::kCurrentVersion)));
-  EXPECT_TRUE(unlogged.client->readFrame().has_value());
+  EXPECT_TRUE(nextFrame(*unlogged.client).has_value());
   EXPECT_TRUE(ping(*unlogged.client, 3));
 }
 
@@ -523,7 +479,7 @@ TEST_F(VantreldProcess, VerbosityAddsDebugLinesThenDumps) {
     ASSERT_TRUE(daemon.client);
     ASSERT_TRUE(daemon.client->send(FrameKind::kRequest, 7,
                                     request(protocol::kRequestBulk, protocol::kCurrentVersion)));
-    ASSERT_TRUE(daemon.client->readFrame().has_value());
+    ASSERT_TRUE(nextFrame(*daemon.client).has_value());
     // The lines of a request are written before its reply is sent.
     EXPECT_EQ(logLines(daemon.log, requestLine).size(), c.debugLines) << readFile(daemon.log);
     EXPECT_EQ(logLines(daemon.log, "bulk options 0x0 not supported").size(), 1u);
