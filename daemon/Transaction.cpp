@@ -94,6 +94,17 @@ void Transaction::dispatch() {
     failMessage(protocol::kErrorBadRequest, "invalid request format (missing type)");
     return;
   }
+  // A connection speaks for the process that made it, whose identity and
+  // entitlements were read then. Bytes another process writes into it (a
+  // child that inherited the socket, while the parent execs something
+  // entitled) must not borrow that identity.
+  if (!request_.fromPeer()) {
+    failMessage(protocol::kErrorAccessDenied,
+                base::format("request \"%@\" refused: it was not written by pid %d, the process "
+                             "this connection belongs to",
+                             *type, client_->pid()));
+    return;
+  }
   for (const Operation& operation : kDispatchTable) {
     if (operation.type == *type) {
       if (operation.scope == Scope::kChangesState && !allowStateChange(*type)) return;

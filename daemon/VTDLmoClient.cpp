@@ -35,6 +35,8 @@ void VTDLmoClient::identifyPeer(const lmo::Connection& connection) {
   }
   server_->debug("client %d %s", pid_, executable ? executable->c_str() : "(unknown executable)");
   probes::clientNew(pid_);
+  pidfd_ = connection.pidfd();
+  executable_ = platform::processExecutableIdentity(pid_);
   base::Result<platform::CodeSigningTaskPtr> task =
       platform::CodeSigningTask::create(pid_, connection.pidfd());
   if (task.has_value()) {
@@ -95,9 +97,29 @@ void VTDLmoClient::dead() {
   probes::clientDone(pid_);
 }
 
+bool VTDLmoClient::runsIdentifiedExecutable() const {
+  if (!executable_) return true;  // never read: the task could not be made either
+  const std::optional<platform::FileIdentity> now = platform::processExecutableIdentity(pid_);
+  // Gone, or a zombie: it runs nothing else, and what it was identified
+  // with stands (a hold it took is still its own).
+  if (!now || *now == *executable_) return true;
+  // Another file under that pid: the peer exec'd, unless the pid now
+  // belongs to another process and the peer is gone.
+  return pidfd_ >= 0 && !platform::checkProcessIdentity(pid_, pidfd_).has_value();
+}
+
 lmo::Value VTDLmoClient::entitlementValueForKey(std::string_view key) const {
   if (!task_) {
     server_->log("error retrieving entitlements for pid %d", pid_);
+    return lmo::Value();
+  }
+  // Entitlements belong to the executable read at connection time: a peer
+  // that has exec'd another program since holds none of them.
+  if (!runsIdentifiedExecutable()) {
+    server_->log(
+        "pid %d no longer runs the executable it connected with; its entitlements are "
+        "not honoured",
+        pid_);
     return lmo::Value();
   }
   platform::CodeSigningTask::Entitlement entitlement = task_->copyValueForEntitlement(key);

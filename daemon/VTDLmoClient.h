@@ -22,6 +22,7 @@
 #include "lmo/Value.h"
 #include "model/VTBundle.h"
 #include "platform/CodeSigning.h"
+#include "platform/ProcessInfo.h"
 #include "registry/VTDHost.h"
 
 namespace vantrel::daemon {
@@ -87,6 +88,8 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
  private:
   VTDLmoClient() = default;
   void identifyPeer(const lmo::Connection& connection);
+  // Whether the peer still runs the executable it was identified with.
+  bool runsIdentifiedExecutable() const;
   void handleEvent(const lmo::Event& event);
   void handleMessage(const lmo::IncomingMessage& message);
   // Counts the request and reports every kRequestCountReportInterval-th.
@@ -102,6 +105,10 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   std::shared_ptr<model::VTBundle> bundle_;
   platform::CodeSigningTaskPtr task_;
   std::optional<base::Error> taskError_;  // why task_ is null
+  // The file the peer ran when it was identified; entitlements are honoured
+  // only while it still runs that file.
+  std::optional<platform::FileIdentity> executable_;
+  int pidfd_ = -1;  // the connection's, which outlives every request
 
   uint32_t requestCount_ = 0;  // Owned by the server's service queue.
 };

@@ -7,6 +7,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <unordered_map>
@@ -149,6 +150,9 @@ Connection::Connection(int fd, QueuePtr targetQueue, bool accepted)
   if (accepted_) {
     groups_ = peerGroups(fd_);
     countUser(uid_, true);
+    // Every read then says which process wrote the bytes.
+    const int on = 1;
+    ::setsockopt(fd_, SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
   }
 }
 
@@ -410,7 +414,8 @@ void Connection::readAvailable() {
       std::lock_guard lock(mutex_);
       if (closed_ || readPaused_) return;
     }
-    ssize_t n = ::recv(fd_, buffer, sizeof buffer, MSG_DONTWAIT);
+    bool fromPeer = true;
+    ssize_t n = receive(buffer, sizeof buffer, fromPeer);
     if (n < 0) {
       if (errno == EINTR) continue;
       if (errno == EAGAIN || errno == EWOULDBLOCK) return;
@@ -427,11 +432,58 @@ void Connection::readAvailable() {
     }
     total += static_cast<size_t>(n);
     reader_.feed(buffer, static_cast<size_t>(n));
+    if (accepted_) {
+      if (!writers_.empty() && writers_.back().second == fromPeer) {
+        writers_.back().first += static_cast<size_t>(n);
+      } else {
+        writers_.emplace_back(static_cast<size_t>(n), fromPeer);
+      }
+    }
     if (!drainFrames()) return;
     // The socket is drained: epoll is level-triggered, so anything that
     // arrives now wakes us again, and a second recv would only say EAGAIN.
     if (static_cast<size_t>(n) < sizeof buffer) return;
   }
+}
+
+ssize_t Connection::receive(uint8_t* buffer, size_t size, bool& fromPeer) {
+  fromPeer = true;
+  if (!accepted_) return ::recv(fd_, buffer, size, MSG_DONTWAIT);
+  iovec io{buffer, size};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))];
+  msghdr message{};
+  message.msg_iov = &io;
+  message.msg_iovlen = 1;
+  message.msg_control = control;
+  message.msg_controllen = sizeof control;
+  const ssize_t n = ::recvmsg(fd_, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+  if (n <= 0) return n;
+  // The kernel hands out one writer's bytes per read. Without credentials
+  // (which SO_PASSCRED guarantees) the writer is unknown: not the peer.
+  fromPeer = false;
+  for (cmsghdr* c = CMSG_FIRSTHDR(&message); c != nullptr; c = CMSG_NXTHDR(&message, c)) {
+    if (c->cmsg_level == SOL_SOCKET && c->cmsg_type == SCM_CREDENTIALS &&
+        c->cmsg_len >= CMSG_LEN(sizeof(ucred))) {
+      ucred cred{};
+      std::memcpy(&cred, CMSG_DATA(c), sizeof cred);
+      fromPeer = cred.pid == pid_;
+    }
+  }
+  return n;
+}
+
+bool Connection::takeWriters(size_t bytes) {
+  if (!accepted_) return true;
+  bool fromPeer = true;
+  while (bytes > 0 && !writers_.empty()) {
+    auto& [count, peer] = writers_.front();
+    const size_t taken = std::min(count, bytes);
+    fromPeer = fromPeer && peer;
+    count -= taken;
+    bytes -= taken;
+    if (count == 0) writers_.pop_front();
+  }
+  return fromPeer;
 }
 
 bool Connection::drainFrames() {
@@ -441,13 +493,15 @@ bool Connection::drainFrames() {
       if (closed_) return false;
       if (readPaused_) break;
     }
+    const size_t before = reader_.bufferedBytes();
     std::optional<base::Result<Frame>> frame = reader_.next();
     if (!frame) break;
     if (!frame->has_value()) {
       invalidate(frame->error());
       return false;
     }
-    if (!handleFrame(std::move(*frame).value())) return false;
+    const bool fromPeer = takeWriters(before - reader_.bufferedBytes());
+    if (!handleFrame(std::move(*frame).value(), fromPeer)) return false;
   }
   noteUnfinishedInput();
   bool paused;
@@ -496,7 +550,7 @@ bool Connection::checkFrameDeadline(std::chrono::steady_clock::time_point now) {
 }
 
 // Returns false when the frame closed the connection.
-bool Connection::handleFrame(Frame&& frame) {
+bool Connection::handleFrame(Frame&& frame, bool fromPeer) {
   if (frame.kind != FrameKind::kReply) {
     const bool request = frame.kind == FrameKind::kRequest;
     {
@@ -508,7 +562,7 @@ bool Connection::handleFrame(Frame&& frame) {
     }
     // A request counts until its reply is sent, a message until its
     // handler has run.
-    deliver(IncomingMessage(std::move(frame.body), frame.id, request), !request);
+    deliver(IncomingMessage(std::move(frame.body), frame.id, request, fromPeer), !request);
     return true;
   }
   std::unique_lock lock(mutex_);

@@ -137,7 +137,13 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // Hands out the complete frames buffered; false when the connection
   // closed or stopped reading meanwhile.
   bool drainFrames();
-  bool handleFrame(Frame&& frame);
+  bool handleFrame(Frame&& frame, bool fromPeer);
+  // Reads from the socket: recv, or on an accepted connection recvmsg with
+  // the writer's credentials (fromPeer: the peer process wrote them).
+  ssize_t receive(uint8_t* buffer, size_t size, bool& fromPeer);
+  // Takes bytes of the writer record for a frame; whether the peer wrote
+  // every one of them.
+  bool takeWriters(size_t bytes);
   void deliver(Event event, bool counted);
   // Accounts the buffered input of an unfinished frame and its deadline.
   void noteUnfinishedInput();
@@ -165,7 +171,10 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // I/O thread only.
   FrameReader reader_;
   size_t unfinishedBytes_ = 0;  // reader_'s bytes, as counted in unfinishedInput()
-  uint64_t framesSeen_ = 0;     // reader_.framesRead() when last accounted
+  // reader_'s bytes by writer, oldest first: (bytes, written by the peer
+  // process). Accepted connections only.
+  std::deque<std::pair<size_t, bool>> writers_;
+  uint64_t framesSeen_ = 0;  // reader_.framesRead() when last accounted
   std::optional<std::chrono::steady_clock::time_point> frameStarted_;
 
   std::atomic<uint64_t> nextId_{1};

@@ -26,18 +26,24 @@ std::string describe(ErrorEvent event);
 // A message received from the peer, as the event handler sees it.
 class IncomingMessage {
  public:
-  IncomingMessage(Dictionary body, uint64_t id, bool expectsReply)
-      : body_(std::move(body)), id_(id), expectsReply_(expectsReply) {}
+  IncomingMessage(Dictionary body, uint64_t id, bool expectsReply, bool fromPeer = true)
+      : body_(std::move(body)), id_(id), expectsReply_(expectsReply), fromPeer_(fromPeer) {}
 
   const Dictionary& body() const { return body_; }
   // The sender's id of the message; replies name it.
   uint64_t id() const { return id_; }
   bool expectsReply() const { return expectsReply_; }
+  // Whether the process the connection was made by wrote it. False when the
+  // kernel named another process as the writer of any of its bytes: a
+  // socket inherited by a child, or kept across an exec by a process that
+  // is gone. Accepted connections only; always true on the client side.
+  bool fromPeer() const { return fromPeer_; }
 
  private:
   Dictionary body_;
   uint64_t id_;
   bool expectsReply_;
+  bool fromPeer_;
 };
 
 // A reply being built for one received message. Fill body, then hand it to

@@ -78,6 +78,11 @@ base::Result<void> clearStaleSocket(const std::string& path, const sockaddr_un& 
 
 Listener::Listener(int fd, std::string path, QueuePtr targetQueue)
     : fd_(fd), path_(std::move(path)), targetQueue_(std::move(targetQueue)) {
+  // Set on the listening socket, the kernel records the writer of every byte
+  // a peer sends, also before its connection is accepted (accepted sockets
+  // inherit it); see Connection's reads.
+  const int on = 1;
+  ::setsockopt(fd_, SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
   reserveFd_ = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
   struct stat st {};
   if (!path_.empty() && ::stat(path_.c_str(), &st) == 0) inode_ = st.st_ino;

@@ -3,9 +3,13 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include "base/Log.h"
 #include "lmo/Protocol.h"
 #include "tests/daemon/DiscoveryFixture.h"
+#include "tests/support/RawClient.h"
 
 namespace vantrel::daemon::testing {
 namespace {
@@ -78,6 +82,64 @@ TEST_F(Scope, AnotherUserMayDiscoverButNotChangeState) {
   const std::string found = askAsOtherUser(peer, "explain", {bundle});
   EXPECT_TRUE(found.starts_with("ok ")) << found;
   EXPECT_EQ(found.find(protocol::kReasonNotInstalled), std::string::npos) << found;
+}
+
+TEST_F(Scope, RequestsAndEntitlementsBelongToTheProcessThatConnected) {
+  const uint64_t all = protocol::bits(protocol::DiscoveryFlags::kAll);
+  const std::string manager = peerWith(
+      "Manager", {{std::string(protocol::kManagerEntitlement), lmo::Value::boolean(true)}});
+  std::string answer;
+  const auto direct = ask(manager, protocol::kRequestMatch, all, {}, &answer);
+  EXPECT_TRUE(answer.starts_with("ok ")) << "the manager itself is served: " << answer;
+
+  // A process that connected and then exec'd keeps its connection, but the
+  // entitlements go with the program that was identified: neither the
+  // manager's for the program it runs next, nor the program it exec's for
+  // one without them.
+  const std::string plain = vantrel::testing::testPeerPath();
+  const std::pair<std::string, std::string> execs[] = {{manager, plain}, {plain, manager}};
+  for (const auto& [first, then] : execs) {
+    base::LogCapture log;
+    const auto execed = vantrel::testing::PeerProcess::start(
+        first, {"exec", socket_, then, "inherited", protocol::kRequestMatch, std::to_string(all)});
+    ASSERT_NE(execed, nullptr);
+    EXPECT_EQ(
+        execed->readLine().value_or("(nothing)"),
+        peerError(protocol::kErrorAccessDenied, "unauthorized discovery flag (VTDiscoverAll)"))
+        << first << " then " << then;
+    EXPECT_TRUE(
+        log.contains(base::format("pid %d no longer runs the executable it connected with; "
+                                  "its entitlements are not honoured",
+                                  execed->pid())))
+        << first << " then " << then;
+  }
+
+  // A child that inherited a connection speaks for nobody: what it writes is
+  // refused, and the connection goes on serving the process that made it.
+  vantrel::testing::RawClient connection(socket_);
+  ASSERT_TRUE(connection.call(protocol::kRequestMatch).has_value());
+  const lmo::Dictionary match =
+      lmo::Dictionary()
+          .setting(protocol::kKeyRequest, protocol::kRequestMatch)
+          .setting(protocol::kKeyVersion, lmo::Value::unsignedInteger(protocol::kCurrentVersion));
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) ::_exit(connection.send(lmo::FrameKind::kRequest, 99, match) ? 0 : 1);
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_EQ(status, 0);
+  const auto refused = connection.readFrame();
+  ASSERT_TRUE(refused && refused->has_value());
+  EXPECT_EQ(refused->value().body.get(protocol::kKeyErrorCode).getIfUInt64(),
+            uint64_t{protocol::kErrorAccessDenied});
+  const std::string* text = refused->value().body.get(protocol::kKeyError).getIfString();
+  EXPECT_EQ(text ? *text : "(none)",
+            base::format("request \"match\" refused: it was not written by pid %d, the process "
+                         "this connection belongs to",
+                         ::getpid()));
+  const auto served = connection.call(protocol::kRequestMatch);
+  ASSERT_TRUE(served.has_value());
+  EXPECT_FALSE(served->get(protocol::kKeyErrorCode).getIfUInt64().has_value());
 }
 
 }  // namespace

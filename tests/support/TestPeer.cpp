@@ -29,6 +29,16 @@
 //              asks "explain" about the bundle at path and writes "ok
 //              <reason> <text>" (the reply's "reason" and "text") or "error
 //              <code> <message>"; exit 0.
+//   exec <service> <program> [<arg>...]
+//              connects with an inheritable socket, sends the empty
+//              "annotate" of connect mode and waits for its reply (the daemon
+//              has identified this process), then execs program with the
+//              args, the socket's descriptor in $VANTREL_TEST_PEER_FD; on a
+//              failure, "error ..." and exit 1.
+//   inherited <type> <flags>
+//              on the connection in $VANTREL_TEST_PEER_FD, sends {"request":
+//              type, "version": <current>, "flags": flags} and writes the
+//              answer as request mode does; exit 0.
 //   read-token <token> <name>
 //              consumes the file-access token as a host does, opens name
 //              relative to the directory it opens and writes the file's
@@ -61,16 +71,19 @@
 #include "client/VTDaemonClient.h"
 #include "lmo/Protocol.h"
 #include "platform/SandboxExtensionService.h"
+#include "tests/support/RawClient.h"
 
 namespace {
 
 using vantrel::client::VTDaemonClient;
+using vantrel::testing::RawClient;
 namespace protocol = vantrel::protocol;
 
 constexpr int kConnectionFailedExit = 1;
 constexpr int kUsageExit = 2;
 constexpr int kReadFailedExit = 1;
 constexpr std::chrono::milliseconds kReplyTimeout = std::chrono::seconds(30);
+constexpr const char* kInheritedFdVariable = "VANTREL_TEST_PEER_FD";
 // The most of a file read through a token that is written out: a bundle's
 // Info.plist is far smaller.
 constexpr size_t kMaxTokenReadBytes = 64 * 1024;
@@ -182,6 +195,39 @@ int requestAndWait(const char* service, const char* type, uint64_t flags,
   return blockUntilStdinCloses();
 }
 
+// The answer line for a reply body: "ok ..." or "error <code> <message>".
+std::string describeReply(const vantrel::lmo::Dictionary& reply) {
+  const vantrel::lmo::Event event(vantrel::lmo::IncomingMessage(reply, 0, false));
+  if (auto refused = VTDaemonClient::errorInReply(event)) {
+    return vantrel::base::format("error %d %s", refused->code, refused->description());
+  }
+  return describeSuccess(reply);
+}
+
+int connectAndExec(const char* service, char** program) {
+  RawClient connection(service, std::chrono::seconds(30), true);
+  if (!connection.call(protocol::kRequestAnnotate,
+                       vantrel::lmo::Dictionary().setting(protocol::kKeyAnnotations,
+                                                          vantrel::lmo::Dictionary()))) {
+    printError(vantrel::base::error_with_code(protocol::kErrorBadRequest, "no connection"));
+    return kConnectionFailedExit;
+  }
+  ::setenv(kInheritedFdVariable, std::to_string(connection.fd()).c_str(), 1);
+  ::execv(program[0], program);
+  printLine(vantrel::base::format("error %d cannot run %s", errno, program[0]));
+  return kConnectionFailedExit;
+}
+
+int requestOnInherited(const char* type, uint64_t flags) {
+  const char* fd = std::getenv(kInheritedFdVariable);
+  RawClient connection = RawClient::adopt(fd ? std::atoi(fd) : -1);
+  const auto reply =
+      connection.call(type, vantrel::lmo::Dictionary().setting(
+                                protocol::kKeyFlags, vantrel::lmo::Value::unsignedInteger(flags)));
+  printLine(reply ? describeReply(*reply) : "error 0 no reply on the inherited connection");
+  return 0;
+}
+
 int explainPath(const char* service, const char* path) {
   auto client = VTDaemonClient::initWithServiceName(service);
   const auto message = client->request(protocol::kRequestExplain)
@@ -259,6 +305,10 @@ int main(int argc, char** argv) {
   if (argc == 3 && mode == "connect") return connectAndWait(argv[2]);
   if (argc == 4 && mode == "read-token") return readThroughToken(argv[2], argv[3]);
   if (argc == 4 && mode == "explain") return explainPath(argv[2], argv[3]);
+  if (argc >= 4 && mode == "exec") return connectAndExec(argv[2], argv + 3);
+  if (argc == 4 && mode == "inherited") {
+    if (auto flags = parseFlags(argv[3])) return requestOnInherited(argv[2], *flags);
+  }
   if (argc >= 4 && mode == "hold") {
     if (auto flags = parseFlags(argv[3])) {
       return holdAndWait(argv[2], *flags, std::vector<std::string>(argv + 4, argv + argc));
