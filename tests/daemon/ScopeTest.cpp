@@ -114,6 +114,25 @@ TEST_F(Scope, RequestsAndEntitlementsBelongToTheProcessThatConnected) {
         << first << " then " << then;
   }
 
+  // The race: connect, fork a child that asks with the connection, exec the
+  // manager's program at once. However the daemon's identification falls
+  // between the two, the child's request is not the peer's.
+  constexpr int kTries = 20;
+  for (int i = 0; i < kTries; ++i) {
+    const auto racer = vantrel::testing::PeerProcess::start(
+        plain, {"race", socket_, protocol::kRequestMatch, std::to_string(all), manager, "sleep"});
+    ASSERT_NE(racer, nullptr);
+    std::optional<std::string> line;
+    while ((line = racer->readLine()) && *line == "ready") {
+    }
+    EXPECT_EQ(line.value_or("(nothing)"),
+              peerError(protocol::kErrorAccessDenied,
+                        base::format("request \"match\" refused: it was not written by pid %d, "
+                                     "the process this connection belongs to",
+                                     racer->pid())))
+        << "try " << i;
+  }
+
   // A child that inherited a connection speaks for nobody: what it writes is
   // refused, and the connection goes on serving the process that made it.
   vantrel::testing::RawClient connection(socket_);

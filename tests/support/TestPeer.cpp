@@ -35,6 +35,11 @@
 //              has identified this process), then execs program with the
 //              args, the socket's descriptor in $VANTREL_TEST_PEER_FD; on a
 //              failure, "error ..." and exit 1.
+//   race <service> <type> <flags> <program> [<arg>...]
+//              connects with an inheritable socket and at once forks: the
+//              child sends {"request": type, "version": <current>, "flags":
+//              flags} on it and writes the answer as request mode does; the
+//              parent execs program with the args without waiting.
 //   inherited <type> <flags>
 //              on the connection in $VANTREL_TEST_PEER_FD, sends {"request":
 //              type, "version": <current>, "flags": flags} and writes the
@@ -218,6 +223,22 @@ int connectAndExec(const char* service, char** program) {
   return kConnectionFailedExit;
 }
 
+int raceExec(const char* service, const char* type, uint64_t flags, char** program) {
+  RawClient connection(service, std::chrono::seconds(30), true);
+  const pid_t child = ::fork();
+  if (child < 0) return kConnectionFailedExit;
+  if (child == 0) {
+    const auto reply = connection.call(
+        type, vantrel::lmo::Dictionary().setting(protocol::kKeyFlags,
+                                                 vantrel::lmo::Value::unsignedInteger(flags)));
+    printLine(reply ? describeReply(*reply) : "error 0 no reply to the child");
+    ::_exit(0);
+  }
+  ::execv(program[0], program);
+  printLine(vantrel::base::format("error %d cannot run %s", errno, program[0]));
+  return kConnectionFailedExit;
+}
+
 int requestOnInherited(const char* type, uint64_t flags) {
   const char* fd = std::getenv(kInheritedFdVariable);
   RawClient connection = RawClient::adopt(fd ? std::atoi(fd) : -1);
@@ -306,6 +327,9 @@ int main(int argc, char** argv) {
   if (argc == 4 && mode == "read-token") return readThroughToken(argv[2], argv[3]);
   if (argc == 4 && mode == "explain") return explainPath(argv[2], argv[3]);
   if (argc >= 4 && mode == "exec") return connectAndExec(argv[2], argv + 3);
+  if (argc >= 6 && mode == "race") {
+    if (auto flags = parseFlags(argv[4])) return raceExec(argv[2], argv[3], *flags, argv + 5);
+  }
   if (argc == 4 && mode == "inherited") {
     if (auto flags = parseFlags(argv[3])) return requestOnInherited(argv[2], *flags);
   }
