@@ -32,17 +32,25 @@ constexpr size_t kMaxReadPerWakeup = 4 * kReadChunk;
 std::atomic<size_t> gOpenConnections{0};
 std::atomic<size_t> gUnfinishedInput{0};
 
-// Accepted connections per peer user.
-std::mutex gUserMutex;
-std::unordered_map<uid_t, size_t> gUserConnections;  // Guarded by gUserMutex.
+// Accepted connections per peer user, guarded by its mutex. Never destroyed:
+// the shared I/O loop's thread may still close connections while the
+// process exits.
+struct UserConnections {
+  std::mutex mutex;
+  std::unordered_map<uid_t, size_t> count;
+};
+UserConnections& userConnections() {
+  static auto* table = new UserConnections;
+  return *table;
+}
 
 void countUser(uid_t uid, bool open) {
-  std::lock_guard lock(gUserMutex);
+  UserConnections& users = userConnections();
+  std::lock_guard lock(users.mutex);
   if (open) {
-    ++gUserConnections[uid];
-  } else if (auto it = gUserConnections.find(uid);
-             it != gUserConnections.end() && --it->second == 0) {
-    gUserConnections.erase(it);
+    ++users.count[uid];
+  } else if (auto it = users.count.find(uid); it != users.count.end() && --it->second == 0) {
+    users.count.erase(it);
   }
 }
 
@@ -201,9 +209,10 @@ size_t Connection::openCount() {
 }
 
 size_t Connection::openCountForUser(uid_t uid) {
-  std::lock_guard lock(gUserMutex);
-  auto it = gUserConnections.find(uid);
-  return it == gUserConnections.end() ? 0 : it->second;
+  UserConnections& users = userConnections();
+  std::lock_guard lock(users.mutex);
+  auto it = users.count.find(uid);
+  return it == users.count.end() ? 0 : it->second;
 }
 
 size_t Connection::unfinishedInput() {

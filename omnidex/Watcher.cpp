@@ -62,16 +62,17 @@ class Watcher::Source : public lmo::IoSource {
       if (n <= 0) break;  // EAGAIN: drained
       // Events the queue has not caught up with are bounded like the
       // kernel's own queue: past the bound they stand for "everything".
-      if (unhandled_.load(std::memory_order_relaxed) + bytes.size() + n > kMaxUnhandledEventBytes) {
+      if (watcher->unhandledEventBytes_.load(std::memory_order_relaxed) + bytes.size() + n >
+          kMaxUnhandledEventBytes) {
         overflow = true;
         continue;
       }
       bytes.insert(bytes.end(), buffer, buffer + n);
     }
     if (bytes.empty() && !overflow) return;
-    unhandled_.fetch_add(bytes.size(), std::memory_order_relaxed);
-    watcher->queue_->async([this, watcher, bytes = std::move(bytes), overflow] {
-      unhandled_.fetch_sub(bytes.size(), std::memory_order_relaxed);
+    watcher->unhandledEventBytes_.fetch_add(bytes.size(), std::memory_order_relaxed);
+    watcher->queue_->async([watcher, bytes = std::move(bytes), overflow] {
+      watcher->unhandledEventBytes_.fetch_sub(bytes.size(), std::memory_order_relaxed);
       if (overflow) watcher->noteAll();
       watcher->handleEvents(bytes);
     });
@@ -83,7 +84,6 @@ class Watcher::Source : public lmo::IoSource {
   Watcher* const watcher_;  // outlives the source: ~Watcher removes it first
   const int fd_;
   const bool timer_;
-  std::atomic<size_t> unhandled_{0};
 };
 
 base::Result<std::unique_ptr<Watcher>> Watcher::create(std::vector<ScanRoot> roots,

@@ -19,6 +19,7 @@
 // bytes and expiries to the queue; the watch table and every directory
 // listing live on the queue.
 
+#include <atomic>
 #include <chrono>
 #include <functional>
 #include <memory>
@@ -92,6 +93,10 @@ class Watcher {
   const int inotifyFd_;
   const int timerFd_;
   const std::shared_ptr<base::SerialQueue> queue_;
+  // Event bytes read on the I/O thread and not yet handled on queue_. Kept
+  // here, not in the source that reads them: a source is gone before the
+  // queue has handled what it handed over.
+  std::atomic<size_t> unhandledEventBytes_{0};
 
   // Touched by the creating thread until start(), then only on queue_
   // (start() submits the first block, which orders the two).
