@@ -1,12 +1,20 @@
 // "annotate": a user's choices about plug-ins (the election, and settings of
 // the extension's own), stored through the database.
 
+#include <cstdint>
+#include <set>
+#include <string>
+#include <vector>
+
 #include "base/Log.h"
+#include "daemon/Limits.h"
 #include "daemon/Transaction.h"
 #include "daemon/VTDLmoClient.h"
 #include "daemon/VTDServer.h"
+#include "lmo/Cbor.h"
 #include "lmo/Message.h"
 #include "lmo/Protocol.h"
+#include "registry/VTDAnnotationStore.h"
 
 namespace vantrel::daemon {
 
@@ -33,21 +41,60 @@ void Transaction::annotatePlugIns() {
       failMessage(protocol::kErrorBadRequest, "invalid request format (annotation extension)");
       return;
     }
+    // Measured as it travels: the decoded form of a value costs more, and
+    // what a peer sends is what the store will write.
+    const base::Result<std::vector<uint8_t>> encoded = lmo::encodeCbor(*extension);
+    const size_t bytes = encoded.has_value() ? encoded.value().size() : SIZE_MAX;
+    if (bytes > kMaxExtensionAnnotationBytes) {
+      failMessage(protocol::kErrorBadRequest,
+                  base::format(kExtensionTooLargeFormat, bytes, kMaxExtensionAnnotationBytes));
+      return;
+    }
     change = change.setting(protocol::kAnnotationExtension, *extension);
   }
   if (change.empty()) {
     done();
     return;
   }
-  const bool annotated = processUuidList([&](const registry::VTDPlugInPtr& plugIn) {
-    base::vtlog("client %d plug-in %@ election := %@", client()->pid(), plugIn->identifier(),
-                change.find(protocol::kAnnotationElection)
-                    ? std::optional(change.get(protocol::kAnnotationElection))
-                    : std::nullopt);
-    server()->setAnnotation(change, *plugIn);
+  // Looked up first and stored in one save; elements before a bad one keep
+  // their effect, as if each were stored in turn.
+  std::vector<registry::VTDPlugInPtr> plugIns;
+  const std::optional<Refusal> refusal = visitUuidList([&](const registry::VTDPlugInPtr& plugIn) {
+    plugIns.push_back(plugIn);
     return true;
   });
-  if (annotated) done();
+  // Every change rewrites the whole store: its number of entries is bounded,
+  // counting the plug-ins this request would add.
+  const lmo::Dictionary stored = server()->annotations()->annotations();
+  std::set<std::string> added;
+  for (const registry::VTDPlugInPtr& plugIn : plugIns) {
+    const std::optional<std::string> key = plugIn->annotationKey();
+    if (key && stored.find(*key) == nullptr) added.insert(*key);
+  }
+  if (!added.empty() && stored.size() + added.size() > kMaxAnnotations) {
+    failMessage(protocol::kErrorBadRequest,
+                base::format(kTooManyAnnotationsFormat, stored.size(), kMaxAnnotations));
+    return;
+  }
+  const std::optional<lmo::Value> election =
+      change.find(protocol::kAnnotationElection)
+          ? std::optional(change.get(protocol::kAnnotationElection))
+          : std::nullopt;
+  for (size_t i = 0; i < plugIns.size() && i < kMaxItemLogLinesPerRequest; ++i) {
+    base::vtlog("client %d plug-in %@ election := %@", client()->pid(), plugIns[i]->identifier(),
+                election);
+  }
+  if (plugIns.size() > kMaxItemLogLinesPerRequest) {
+    base::vtlog("client %d: %u more plug-ins, election := %@", client()->pid(),
+                plugIns.size() - kMaxItemLogLinesPerRequest, election);
+  }
+  // Stored before the reply is sent, whichever it is.
+  if (!plugIns.empty()) server()->setAnnotation(change, plugIns);
+  if (refusal) {
+    failMessage(refusal->code, refusal->message);
+  } else {
+    done();
+  }
 }
 
 }  // namespace vantrel::daemon

@@ -1,8 +1,10 @@
 // "lock": taking and releasing holds on plug-ins.
 
+#include <algorithm>
 #include <vector>
 
 #include "base/Log.h"
+#include "daemon/Limits.h"
 #include "daemon/Transaction.h"
 #include "daemon/VTDLmoClient.h"
 #include "daemon/VTDPlugInHold.h"
@@ -32,6 +34,7 @@ void Transaction::lockDownPlugIns() {
           lmo::lmo_dictionary_get_array(request(), protocol::kKeyUuids)) {
     // Whoever presents a token releases its hold. Elements that are not
     // UUIDs name no hold and release nothing.
+    if (!withinLimit(protocol::kKeyUuids, tokens->size(), kMaxUuidsPerRequest)) return;
     for (const lmo::Value& token : *tokens) {
       if (const base::Uuid* uuid = token.getIfUuid()) server()->unholdToken(*uuid);
     }
@@ -39,6 +42,21 @@ void Transaction::lockDownPlugIns() {
     return;
   }
   if (!allowStateChange(protocol::kRequestLock)) return;
+  {
+    const std::vector<std::shared_ptr<VTDPlugInHold>> holds = server()->holds();
+    const size_t own = static_cast<size_t>(std::count_if(
+        holds.begin(), holds.end(), [&](const auto& hold) { return hold->client() == client(); }));
+    if (own >= kMaxHoldsPerClient) {
+      failMessage(protocol::kErrorAccessDenied,
+                  base::format(kHoldsPerClientFormat, own, kMaxHoldsPerClient));
+      return;
+    }
+    if (holds.size() >= kMaxHolds) {
+      failMessage(protocol::kErrorAccessDenied,
+                  base::format(kHoldsFormat, holds.size(), kMaxHolds));
+      return;
+    }
+  }
   // Compared whole: a value with any other bit set is refused.
   const auto flags = static_cast<protocol::HoldFlags>(
       request().get(protocol::kKeyFlags).getIfUInt64().value_or(0));

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "base/Log.h"
+#include "daemon/Limits.h"
 #include "daemon/MatchFilters.h"
 #include "daemon/Transaction.h"
 #include "daemon/VTDLmoClient.h"
@@ -167,6 +168,13 @@ bool Transaction::readMatchInput(std::optional<lmo::Dictionary>& rules, MatchSta
       return false;
     }
     rules = lmo::propertyListFromMessage(*dictionary);
+    if (!withinLimit(kRuleKeysName, rules->size(), kMaxRuleKeys)) return false;
+    for (const auto& [key, pattern] : *rules) {
+      const lmo::Array* list = pattern.getIfArray();
+      const lmo::Dictionary* items = pattern.getIfDictionary();
+      const size_t elements = list ? list->size() : items ? items->size() : 1;
+      if (!withinLimit(kPatternElementsName, elements, kMaxPatternElements)) return false;
+    }
   }
   state.flags =
       static_cast<DiscoveryFlags>(request().get(protocol::kKeyFlags).getIfUInt64().value_or(0));

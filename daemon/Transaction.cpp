@@ -9,20 +9,18 @@
 #include "base/Check.h"
 #include "base/Format.h"
 #include "base/Log.h"
+#include "daemon/Limits.h"
 #include "daemon/VTDLmoClient.h"
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
 #include "lmo/Protocol.h"
 #include "platform/PeerPaths.h"
 #include "platform/Probes.h"
+#include "registry/VTDPlugIn.h"
 
 namespace vantrel::daemon {
 
 namespace {
-
-// Canonical paths longer than this are treated as unresolvable, as a fixed
-// buffer of that size would.
-constexpr size_t kMaxCanonicalPathBytes = 1024;
 
 // Whether a request changes the state the daemon keeps for its user.
 enum class Scope { kAnyPeer, kChangesState };
@@ -108,6 +106,9 @@ void Transaction::dispatch() {
   for (const Operation& operation : kDispatchTable) {
     if (operation.type == *type) {
       if (operation.scope == Scope::kChangesState && !allowStateChange(*type)) return;
+      // Rules are matched against every candidate: one request logs an
+      // unknown operator once, not once per candidate and element.
+      registry::MatchLogOnce logOnce;
       (this->*operation.run)();
       return;
     }
@@ -166,6 +167,12 @@ void Transaction::failError(int32_t code, const base::Error& error) {
   }
 }
 
+bool Transaction::withinLimit(const char* what, size_t given, size_t limit) {
+  if (given <= limit) return true;
+  failMessage(protocol::kErrorBadRequest, base::format(kTooManyFormat, what, given, limit));
+  return false;
+}
+
 bool Transaction::marshalPaths(const PathBlock& block) {
   const std::optional<lmo::Array> paths =
       lmo::lmo_dictionary_get_array(request(), protocol::kKeyPaths);
@@ -173,6 +180,7 @@ bool Transaction::marshalPaths(const PathBlock& block) {
     failMessage(protocol::kErrorBadRequest, "invalid request format");
     return false;
   }
+  if (!withinLimit(protocol::kKeyPaths, paths->size(), kMaxPathsPerRequest)) return false;
   for (const lmo::Value& element : *paths) {
     const std::string* path = element.getIfString();
     if (path == nullptr) {
@@ -197,26 +205,29 @@ bool Transaction::processPaths(const PathBlock& block) {
 }
 
 bool Transaction::processUuidList(const PlugInBlock& block) {
+  const std::optional<Refusal> refusal = visitUuidList(block);
+  if (refusal && refusal->code != 0) failMessage(refusal->code, refusal->message);
+  return !refusal;
+}
+
+std::optional<Transaction::Refusal> Transaction::visitUuidList(const PlugInBlock& block) {
   const std::optional<lmo::Array> uuids =
       lmo::lmo_dictionary_get_array(request(), protocol::kKeyUuids);
-  if (!uuids) {
-    failMessage(protocol::kErrorBadRequest, "invalid request format (uuid)");
-    return false;
+  if (!uuids) return Refusal{protocol::kErrorBadRequest, "invalid request format (uuid)"};
+  if (uuids->size() > kMaxUuidsPerRequest) {
+    return Refusal{protocol::kErrorBadRequest, base::format(kTooManyFormat, protocol::kKeyUuids,
+                                                            uuids->size(), kMaxUuidsPerRequest)};
   }
   for (const lmo::Value& element : *uuids) {
     const base::Uuid* uuid = element.getIfUuid();
     if (uuid == nullptr) {
-      failMessage(protocol::kErrorBadRequest, "invalid request (bad uuid array)");
-      return false;
+      return Refusal{protocol::kErrorBadRequest, "invalid request (bad uuid array)"};
     }
     registry::VTDPlugInPtr plugIn = server()->findPlugIn(*uuid);
-    if (!plugIn) {
-      failMessage(protocol::kErrorBadRequest, "no such plugin (uuid not found)");
-      return false;
-    }
-    if (!block(plugIn)) return false;
+    if (!plugIn) return Refusal{protocol::kErrorBadRequest, "no such plugin (uuid not found)"};
+    if (!block(plugIn)) return Refusal{0, ""};
   }
-  return true;
+  return std::nullopt;
 }
 
 }  // namespace vantrel::daemon

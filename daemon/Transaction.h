@@ -61,6 +61,9 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   // of the system's domain, else with code and the error's description.
   void failError(int32_t code, const base::Error& error);
 
+  // Whether a request's count of what stays within limit; else replies
+  // itself with code 4 "too many <what>: ..." and returns false.
+  bool withinLimit(const char* what, size_t given, size_t limit);
   // Decodes "paths", handing each to block. On a decoding error it replies
   // itself and returns false; otherwise it sends nothing and returns whether
   // every path was accepted.
@@ -70,6 +73,15 @@ class Transaction : public std::enable_shared_from_this<Transaction> {
   // Decodes "uuids" and looks each plug-in up, handing it to block. Replies
   // itself on a decoding or lookup error; sends nothing on success.
   bool processUuidList(const PlugInBlock& block);
+  // A reply not sent yet: its code and text.
+  struct Refusal {
+    int32_t code;
+    std::string message;
+  };
+  // As processUuidList without replying: the decoding or lookup error, or
+  // nullopt. A block that returns false stops it and replied itself; that
+  // gives a refusal with code 0.
+  std::optional<Refusal> visitUuidList(const PlugInBlock& block);
 
   // ---- Operations, one per request type ----
   void addPlugIns();

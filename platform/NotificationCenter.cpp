@@ -77,7 +77,7 @@ std::string notificationDirectory() {
   return runtimeDirectory() + "/notify";
 }
 
-base::Result<uint64_t> postNotification(std::string_view name) {
+base::Result<uint64_t> postNotification(std::string_view name, uint64_t times) {
   if (!isValidName(name)) {
     return posixError(EINVAL, "invalid notification name", std::string(name));
   }
@@ -92,7 +92,7 @@ base::Result<uint64_t> postNotification(std::string_view name) {
   startIn(dir);
 
   const std::string path = dir + "/" + std::string(name);
-  const uint64_t next = readCounter(path) + 1;
+  const uint64_t next = readCounter(path) + times;
   const std::string text = std::to_string(next) + "\n";
   if (auto written = writeFileAtomically(path, text, kFileMode); !written.has_value()) {
     // A failed sync of the directory leaves the new value in place; every

@@ -29,8 +29,9 @@ std::string notificationDirectory();
 // Errors: the name is not a valid single path component (empty, ".", "..",
 // contains '/' or NUL, or longer than kMaxNotificationNameLength): domain
 // "POSIX", EINVAL; or I/O: domain "POSIX" with the errno. On error the counter
-// is unchanged.
-base::Result<uint64_t> postNotification(std::string_view name);
+// is unchanged. With times, that many posts in one write: the counter moves
+// by times, as if each had been made.
+base::Result<uint64_t> postNotification(std::string_view name, uint64_t times = 1);
 
 // The current counter of a notification; 0 when never posted, when the name is
 // invalid, or when the file cannot be read or does not hold a number.

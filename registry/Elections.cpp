@@ -16,11 +16,11 @@ std::optional<lmo::Dictionary> VTDatabase::annotationForPlugIn(const VTDPlugIn& 
   return annotation;
 }
 
-void postAnnotationChange() {
+void postAnnotationChange(size_t changes) {
   // The notification carries nothing, so a post that fails costs watchers
   // one refresh; it is logged and not reported.
   base::Result<uint64_t> posted =
-      platform::postNotification(protocol::kAnnotationChangeNotification);
+      platform::postNotification(protocol::kAnnotationChangeNotification, changes);
   if (!posted.has_value()) {
     base::vtlog("unable to post notification %@: %@", protocol::kAnnotationChangeNotification,
                 posted.error());
@@ -33,6 +33,13 @@ std::optional<base::Error> VTDatabase::setAnnotation(
   // Posted off the queue: watchers that react by asking the daemon must not
   // find the queue still held.
   postAnnotationChange();
+  return std::nullopt;
+}
+
+std::optional<base::Error> VTDatabase::setAnnotation(
+    const std::optional<lmo::Dictionary>& annotation, const std::vector<VTDPlugInPtr>& plugIns) {
+  sync_.sync([&] { annotations_->setAnnotation(annotation, plugIns); });
+  postAnnotationChange(plugIns.size());
   return std::nullopt;
 }
 

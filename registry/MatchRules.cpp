@@ -53,7 +53,30 @@ const lmo::Value& booleanFalse() {
   return value;
 }
 
+// This thread's MatchLogOnce state: whether a scope is open, and whether it
+// has logged.
+thread_local bool tlsLogScope = false;
+thread_local bool tlsLogged = false;
+
 }  // namespace
+
+MatchLogOnce::MatchLogOnce() : outermost_(!tlsLogScope) {
+  if (outermost_) {
+    tlsLogScope = true;
+    tlsLogged = false;
+  }
+}
+
+MatchLogOnce::~MatchLogOnce() {
+  if (outermost_) tlsLogScope = false;
+}
+
+bool MatchLogOnce::mayLog() {
+  if (!tlsLogScope) return true;
+  if (tlsLogged) return false;
+  tlsLogged = true;
+  return true;
+}
 
 bool VTDPlugIn::match(const std::optional<lmo::Dictionary>& rules) const {
   if (!rules) return true;
@@ -118,7 +141,7 @@ bool VTDPlugIn::matchValuePattern(std::string_view value, std::string_view patte
     if (pattern.starts_with(kIsPrefix)) {
       return platform::typeConformsTo(pattern.substr(kIsPrefix.size()), value);
     }
-    base::vtlog("unrecognized match operator:%@", pattern);
+    if (MatchLogOnce::mayLog()) base::vtlog("unrecognized match operator:%@", pattern);
     return false;
   }
   Comparison comparison{"", 0, false};

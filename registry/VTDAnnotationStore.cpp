@@ -2,6 +2,8 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <set>
+#include <vector>
 
 #include "base/Check.h"
 #include "base/Log.h"
@@ -153,21 +155,49 @@ std::optional<Dictionary> VTDAnnotationStore::annotationForPlugIn(const VTDPlugI
 
 void VTDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
                                        const VTDPlugIn& plugIn) {
-  // A record without identifier has nowhere to keep an annotation; the
-  // construction paths never make one, so only the save below happens.
-  if (std::optional<std::string> key = plugIn.annotationKey()) {
-    std::lock_guard lock(mutex_);
-    if (!annotation) {
-      table_ = table_.removing(*key);
-    } else {
-      const Dictionary* stored = table_.get(*key).getIfDictionary();
-      Dictionary merged = stored ? *stored : Dictionary();
-      for (const Dictionary::Entry& entry : *annotation) {
-        merged = merged.setting(entry.first, entry.second);
-      }
-      table_ = table_.setting(*key, Value(std::move(merged)));
+  setAnnotation(annotation, std::vector<const VTDPlugIn*>{&plugIn});
+}
+
+void VTDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const std::vector<std::shared_ptr<VTDPlugIn>>& plugIns) {
+  std::vector<const VTDPlugIn*> records;
+  records.reserve(plugIns.size());
+  for (const std::shared_ptr<VTDPlugIn>& plugIn : plugIns) records.push_back(plugIn.get());
+  setAnnotation(annotation, records);
+}
+
+void VTDAnnotationStore::setAnnotation(const std::optional<Dictionary>& annotation,
+                                       const std::vector<const VTDPlugIn*>& plugIns) {
+  {
+    // A record without identifier has nowhere to keep an annotation; the
+    // construction paths never make one, so only the save happens. The
+    // table is rebuilt once, however many plug-ins change.
+    std::set<std::string> keys;
+    for (const VTDPlugIn* plugIn : plugIns) {
+      if (std::optional<std::string> key = plugIn->annotationKey()) keys.insert(std::move(*key));
     }
+    std::lock_guard lock(mutex_);
+    std::vector<Dictionary::Entry> entries;
+    entries.reserve(table_.size() + keys.size());
+    for (const Dictionary::Entry& entry : table_) {
+      if (!keys.contains(entry.first)) entries.push_back(entry);
+    }
+    if (annotation) {
+      for (const std::string& key : keys) {
+        const Dictionary* stored = table_.get(key).getIfDictionary();
+        Dictionary merged = stored ? *stored : Dictionary();
+        for (const Dictionary::Entry& entry : *annotation) {
+          merged = merged.setting(entry.first, entry.second);
+        }
+        entries.emplace_back(key, Value(std::move(merged)));
+      }
+    }
+    table_ = Dictionary::fromEntries(std::move(entries));
   }
+  save();
+}
+
+void VTDAnnotationStore::save() {
   base::Error error;
   if (!saveDb(&error)) {
     base::vtlog("unable to save annotations:%@ error:%@", annotationsURL_, error);

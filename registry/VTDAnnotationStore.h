@@ -12,6 +12,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "base/Error.h"
 #include "lmo/Value.h"
@@ -66,6 +67,9 @@ class VTDAnnotationStore {
   // error:%@") and the change kept in memory for the next save. Saves even
   // when nothing changed.
   void setAnnotation(const std::optional<lmo::Dictionary>& annotation, const VTDPlugIn& plugIn);
+  // As setAnnotation for each of plugIns, with one save for them all.
+  void setAnnotation(const std::optional<lmo::Dictionary>& annotation,
+                     const std::vector<std::shared_ptr<VTDPlugIn>>& plugIns);
 
   // Replaces the table with the file's "data". False on failure, with the
   // reason in *error when error is not null (a missing file: code
@@ -83,6 +87,12 @@ class VTDAnnotationStore {
   void setAnnotations(lmo::Dictionary table);
 
  private:
+  // Merges annotation into the entry of each of plugIns (or removes them
+  // for null), then saves once.
+  void setAnnotation(const std::optional<lmo::Dictionary>& annotation,
+                     const std::vector<const VTDPlugIn*>& plugIns);
+  // Writes the table, logging a failure.
+  void save();
   // Removes the atomic writer's stale temporaries of the annotation file.
   void removeInterruptedSaves() const;
 

@@ -35,6 +35,22 @@ inline constexpr std::string_view kHubProtocolVersionKey = "HubProtocolVersion";
 
 class VTDatabase;
 
+// While one lives on a thread, "unrecognized match operator:<pattern>" is
+// logged at most once there. Scopes nest; the outermost one counts.
+class MatchLogOnce {
+ public:
+  MatchLogOnce();
+  ~MatchLogOnce();
+  MatchLogOnce(const MatchLogOnce&) = delete;
+  MatchLogOnce& operator=(const MatchLogOnce&) = delete;
+
+  // Whether the line may be written now (and counts it).
+  static bool mayLog();
+
+ private:
+  bool outermost_;
+};
+
 class VTDPlugIn : public model::VTPlugInCore {
  public:
   // Hub protocol versions of plug-ins that do not declare one.

@@ -36,9 +36,9 @@
 
 namespace vantrel::registry {
 
-// Posts protocol::kAnnotationChangeNotification; a failure is logged, not
-// reported.
-void postAnnotationChange();
+// Posts protocol::kAnnotationChangeNotification, once per change (in one
+// write); a failure is logged, not reported.
+void postAnnotationChange(size_t changes = 1);
 // The cache limit a database starts with.
 inline constexpr uint32_t kDefaultCacheLimit = 150;
 
@@ -130,6 +130,9 @@ class VTDatabase : public omnidex::WorkspaceObserver,
   // only logged.
   std::optional<base::Error> setAnnotation(const std::optional<lmo::Dictionary>& annotation,
                                            const VTDPlugIn& plugIn);
+  // As setAnnotation for each of plugIns, with one save and one post.
+  std::optional<base::Error> setAnnotation(const std::optional<lmo::Dictionary>& annotation,
+                                           const std::vector<VTDPlugInPtr>& plugIns);
   // Stores election 1 for a plug-in whose election is missing or 0, keeping
   // the rest of its annotation; posts nothing. On the database queue only.
   void autoElect(const VTDPlugIn& plugIn);
