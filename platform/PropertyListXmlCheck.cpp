@@ -435,6 +435,9 @@ base::Result<std::string> XmlPreflight::run() {
   }
   if (!stack_.empty()) return malformed("unterminated element");
   if (!rootDone_) return malformed("no value");
+  // A root value without <plist> around it reads as if it had one; libplist
+  // is handed the one form, so what it reads never depends on the wrapper.
+  if (!out_.starts_with("<plist>")) return "<plist>" + out_ + "</plist>";
   return std::move(out_);
 }
 
