@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <cstring>
 #include <unordered_map>
+#include <utility>
 
 #include "base/Check.h"
 #include "base/Log.h"
@@ -300,17 +301,26 @@ base::Result<void> Connection::sendWithReply(const Dictionary& message, QueuePtr
 
 base::Result<void> Connection::sendReply(const Reply& reply) {
   VT_CHECK(reply.inReplyTo != 0, "reply not made by createReply");
+  // The request is answered once the reply has been written out (see
+  // writeLocked): a peer that does not read its replies stops being read,
+  // instead of having them pile up here. A reply that cannot be encoded
+  // answers it now.
   base::Result<void> sent = sendFrame(FrameKind::kReply, reply.inReplyTo, reply.body, std::nullopt);
-  noteAnswered();
+  if (!sent.has_value()) noteAnswered();
   return sent;
+}
+
+bool Connection::answeredLocked() {
+  if (unanswered_ > 0) --unanswered_;
+  if (!readPaused_ || unanswered_ >= kMaxUnansweredRequests || closed_ || doomed_) return false;
+  readPaused_ = false;
+  return true;
 }
 
 void Connection::noteAnswered() {
   {
     std::lock_guard lock(mutex_);
-    if (unanswered_ > 0) --unanswered_;
-    if (!readPaused_ || unanswered_ >= kMaxUnansweredRequests || closed_ || doomed_) return;
-    readPaused_ = false;
+    if (!answeredLocked()) return;
   }
   auto self = shared_from_this();
   IoLoop::shared().post([self] { self->resumeReading(); });
@@ -343,7 +353,7 @@ base::Result<void> Connection::sendFrame(FrameKind kind, uint64_t inReplyTo, con
   }
   if (pending) pending_.emplace(frame.id, std::move(*pending));
   outputBytes_ += bytes.size();
-  output_.push_back(std::move(bytes));
+  output_.emplace_back(std::move(bytes), kind == FrameKind::kReply);
   if (output_.size() == 1) writeLocked();
   if (doomed_) return base::Result<void>::success();
   if (outputBytes_ > outputLimit_) {
@@ -368,13 +378,14 @@ base::Result<void> Connection::sendFrame(FrameKind kind, uint64_t inReplyTo, con
 // Writes queued output until the socket would block. A write error means the
 // peer is gone: the connection is invalidated (quietly; that is not bad input).
 void Connection::writeLocked() {
+  bool resume = false;
   while (!output_.empty() && fd_ >= 0) {
-    const std::vector<uint8_t>& front = output_.front();
+    const std::vector<uint8_t>& front = output_.front().first;
     ssize_t n = ::send(fd_, front.data() + outputOffset_, front.size() - outputOffset_,
                        MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n < 0) {
       if (errno == EINTR) continue;
-      if (errno == EAGAIN || errno == EWOULDBLOCK) return;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) break;
       doomed_ = true;
       auto self = shared_from_this();
       IoLoop::shared().post([self] { self->invalidate(std::nullopt); });
@@ -383,9 +394,14 @@ void Connection::writeLocked() {
     outputBytes_ -= static_cast<size_t>(n);
     outputOffset_ += static_cast<size_t>(n);
     if (outputOffset_ == front.size()) {
+      if (output_.front().second) resume |= answeredLocked();
       output_.pop_front();
       outputOffset_ = 0;
     }
+  }
+  if (resume) {
+    auto self = shared_from_this();
+    IoLoop::shared().post([self] { self->resumeReading(); });
   }
 }
 
@@ -604,13 +620,43 @@ void Connection::deliver(Event event, bool counted) {
     return;
   }
   if (!counted) {
-    queue->async([handler = std::move(handler), event = std::move(event)] { handler(event); });
+    enqueue(queue, [handler = std::move(handler), event = std::move(event)] { handler(event); });
     return;
   }
-  queue->async([self = shared_from_this(), handler = std::move(handler), event = std::move(event)] {
-    handler(event);
-    self->noteAnswered();
-  });
+  enqueue(queue,
+          [self = shared_from_this(), handler = std::move(handler), event = std::move(event)] {
+            handler(event);
+            self->noteAnswered();
+          });
+}
+
+void Connection::enqueue(const QueuePtr& queue, std::function<void()> task) {
+  bool schedule = false;
+  {
+    std::lock_guard lock(inboxMutex_);
+    inbox_.push_back(std::move(task));
+    schedule = !std::exchange(inboxScheduled_, true);
+  }
+  if (schedule) queue->async([self = shared_from_this(), queue] { self->runInbox(queue); });
+}
+
+void Connection::runInbox(const QueuePtr& queue) {
+  std::function<void()> task;
+  {
+    std::lock_guard lock(inboxMutex_);
+    task = std::move(inbox_.front());
+    inbox_.pop_front();
+  }
+  task();
+  task = nullptr;  // what it holds goes before the next turn, as a block's would
+  bool more = false;
+  {
+    std::lock_guard lock(inboxMutex_);
+    more = !inbox_.empty();
+    if (!more) inboxScheduled_ = false;
+  }
+  // To the back of the queue: every other connection's turn comes first.
+  if (more) queue->async([self = shared_from_this(), queue] { self->runInbox(queue); });
 }
 
 void Connection::terminationImminent() {
@@ -651,8 +697,9 @@ void Connection::invalidate(std::optional<base::Error> reason) {
   for (auto& [id, p] : pending) {
     p.queue->async([h = std::move(p.handler)] { h(ErrorEvent::kConnectionInvalid); });
   }
-  queue->async([handler = std::move(handler), finalizer = std::move(finalizer),
-                context = std::move(context)]() mutable {
+  // After every event delivered before it.
+  enqueue(queue, [handler = std::move(handler), finalizer = std::move(finalizer),
+                  context = std::move(context)]() mutable {
     if (handler) handler(ErrorEvent::kConnectionInvalid);
     if (finalizer) finalizer();
     // The context goes with this block, after the finalizer.

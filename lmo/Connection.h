@@ -133,6 +133,8 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   base::Result<void> sendFrame(FrameKind kind, uint64_t inReplyTo, const Dictionary& body,
                                std::optional<PendingReply> pending);
   void writeLocked();
+  // Counts one request or message answered; whether reading must resume.
+  bool answeredLocked();
   void readAvailable();
   // Hands out the complete frames buffered; false when the connection
   // closed or stopped reading meanwhile.
@@ -145,6 +147,12 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // every one of them.
   bool takeWriters(size_t bytes);
   void deliver(Event event, bool counted);
+  // Runs task on queue after every task this connection handed it before,
+  // holding at most one place in the queue at a time: connections take
+  // turns, so one that sends a lot waits behind the others, not ahead.
+  void enqueue(const QueuePtr& queue, std::function<void()> task);
+  // Runs the oldest task of the inbox, then gives up its place.
+  void runInbox(const QueuePtr& queue);
   // Accounts the buffered input of an unfinished frame and its deadline.
   void noteUnfinishedInput();
   // A request was answered or a message handled: below the bound, reading
@@ -190,13 +198,23 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   bool closed_ = false;  // the socket is closed and the final events sent
   uint64_t token_ = 0;   // the IoLoop registration, 0 when not registered
   bool watchingOutput_ = false;
-  std::deque<std::vector<uint8_t>> output_;
+  // Frames to write, each with whether it is the reply that answers a
+  // request: a request counts as unanswered until its reply has left.
+  std::deque<std::pair<std::vector<uint8_t>, bool>> output_;
   size_t outputOffset_ = 0;  // bytes of output_.front() already written
   size_t outputBytes_ = 0;   // unsent bytes in output_
   size_t outputLimit_ = kMaxPendingOutput;
-  size_t unanswered_ = 0;    // requests not yet answered, messages not yet handled
+  // Requests whose reply has not been written out yet, messages not yet
+  // handled.
+  size_t unanswered_ = 0;
   bool readPaused_ = false;  // unanswered_ reached kMaxUnansweredRequests
   std::unordered_map<uint64_t, PendingReply> pending_;
+
+  // Tasks for the target queue, oldest first, and whether one of them is in
+  // the queue now. Guarded by inboxMutex_, never held with mutex_.
+  std::mutex inboxMutex_;
+  std::deque<std::function<void()>> inbox_;
+  bool inboxScheduled_ = false;
 };
 
 // "<connection pid=%d>" for log lines.

@@ -24,10 +24,11 @@ inline constexpr size_t kMaxConnectionsPerUser = 512;
 // Unsent output a peer may leave queued before it is disconnected.
 inline constexpr size_t kMaxPendingOutput = 64 * 1024 * 1024;
 
-// Requests received on one connection and not yet answered (and messages
-// not yet handled) past which the connection is not read: a peer that
-// pipelines without waiting waits on its own socket buffer instead of
-// growing this process's queues. Reading resumes below the bound.
+// Requests received on one connection whose replies have not been written
+// out yet (and messages not yet handled), past which the connection is not
+// read: a peer that pipelines without reading its replies waits on its own
+// socket buffers instead of growing this process's queues or its output.
+// Reading resumes below the bound.
 inline constexpr size_t kMaxUnansweredRequests = 64;
 
 // Once a frame has begun, the rest must arrive within this time; a peer

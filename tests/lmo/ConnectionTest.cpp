@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 
 #include <poll.h>
@@ -453,6 +454,56 @@ TEST_F(ConnectionTest, APipeliningPeerIsReadNoFurtherThanItsUnansweredRequests) 
     const ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
     ASSERT_GT(n, 0);
     replies.feed(buffer, static_cast<size_t>(n));
+    while (auto frame = replies.next()) {
+      ASSERT_TRUE(frame->has_value());
+      EXPECT_EQ((*frame)->inReplyTo, ++answered);
+    }
+  }
+  EXPECT_EQ(server_.serverEvents.count("connection invalid"), 0u);
+  ::close(fd);
+}
+
+TEST_F(ConnectionTest, ARequestCountsUntilItsReplyHasLeft) {
+  // Requests with 64 KiB replies from a peer that reads none: once the
+  // socket is full, replies waiting to be written keep the requests
+  // unanswered, so the peer is read no further and nothing piles up here.
+  const size_t total = 4 * kMaxUnansweredRequests;
+  Bytes stream;
+  for (size_t i = 1; i <= total; ++i) {
+    Bytes frame =
+        frameOf(FrameKind::kRequest, i, Dictionary{{"pad", Value::data(Bytes(64 * 1024, 7))}});
+    stream.insert(stream.end(), frame.begin(), frame.end());
+  }
+  int fd = rawConnect(path_);
+  ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
+  size_t sent = 0;
+  for (const auto until = std::chrono::steady_clock::now() + 1s;
+       sent < stream.size() && std::chrono::steady_clock::now() < until;) {
+    const ssize_t n = ::send(fd, stream.data() + sent, stream.size() - sent, MSG_NOSIGNAL);
+    if (n > 0) sent += static_cast<size_t>(n);
+    if (n < 0) std::this_thread::sleep_for(10ms);
+  }
+  // The bound, and the few replies the socket itself holds.
+  constexpr size_t kInSocket = 16;
+  ASSERT_TRUE(server_.serverEvents.waitFor(kMaxUnansweredRequests));
+  EXPECT_FALSE(server_.serverEvents.waitFor(kMaxUnansweredRequests + kInSocket, 300ms));
+
+  // Reading the replies lets the rest in: every request is answered.
+  ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) & ~O_NONBLOCK);
+  const timeval timeout{10, 0};
+  ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+  FrameReader replies;
+  uint64_t answered = 0;
+  std::vector<uint8_t> buffer(256 * 1024);
+  while (answered < total) {
+    if (sent < stream.size()) {
+      const ssize_t n =
+          ::send(fd, stream.data() + sent, stream.size() - sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+      if (n > 0) sent += static_cast<size_t>(n);
+    }
+    const ssize_t n = ::recv(fd, buffer.data(), buffer.size(), 0);
+    ASSERT_GT(n, 0);
+    replies.feed(buffer.data(), static_cast<size_t>(n));
     while (auto frame = replies.next()) {
       ASSERT_TRUE(frame->has_value());
       EXPECT_EQ((*frame)->inReplyTo, ++answered);
