@@ -132,9 +132,9 @@ void Transaction::explainPlugIn() {
   std::unique_ptr<NamedHost> named;
   std::shared_ptr<model::VTBundle> hostBundle = client()->bundle();
   if (otherHost) {
+    const pid_t hostPid = static_cast<pid_t>(pid.value_or(0));
     base::Result<platform::CodeSigningTaskPtr> task = [&] {
       if (hostPath != nullptr) return platform::CodeSigningTask::createForBundle(*hostPath);
-      const pid_t hostPid = static_cast<pid_t>(*pid);
       platform::ScopedFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, hostPid, 0)));
       return platform::CodeSigningTask::create(hostPid, pidfd.get());
     }();

@@ -38,6 +38,7 @@ expect "$runtime" sbin/vantreld bin/vantrelctl bin/vantrel-inspect \
   lib/systemd/system/vantreld.service lib/systemd/system/vantreld.socket \
   lib/systemd/user/vantreld.service lib/systemd/user/vantreld.socket \
   share/bash-completion/completions/vantrelctl share/man/man1/vantrelctl.1 \
+  share/man/man1/vantrel-inspect.1 share/man/man8/vantreld.8 \
   share/vantrel/sdks/README
 expect "$dev" include/vantrel/client/VTDaemonClient.h include/vantrel/lmo/Protocol.h \
   'lib/(.*/)?pkgconfig/vantrel-client\.pc' 'lib/(.*/)?cmake/vantrel-client/vantrel-clientConfig\.cmake'
