@@ -37,9 +37,9 @@ LogSink& currentSink() {
   return sink;
 }
 
-}  // namespace
+thread_local LogBudget* tlsBudget = nullptr;
 
-void writeLog(LogLevel level, std::string_view line) {
+void writeToSink(LogLevel level, std::string_view line) {
   LogSink sink;
   {
     std::lock_guard lock(sinkMutex());
@@ -50,6 +50,58 @@ void writeLog(LogLevel level, std::string_view line) {
   } else {
     defaultSink(level, line);
   }
+}
+
+}  // namespace
+
+void writeLog(LogLevel level, std::string_view line) {
+  if (tlsBudget != nullptr && static_cast<int>(level) <= static_cast<int>(LogLevel::kNotice)) {
+    size_t dropped = 0;
+    if (!tlsBudget->admit(LogBudget::Clock::now(), &dropped)) return;
+    if (dropped != 0) writeToSink(LogLevel::kNotice, tlsBudget->suppressedLine(dropped));
+  }
+  writeToSink(level, line);
+}
+
+LogBudget::LogBudget(std::string label, size_t burst, size_t perSecond)
+    : label_(std::move(label)),
+      burst_(static_cast<double>(burst)),
+      perSecond_(static_cast<double>(perSecond)),
+      tokens_(static_cast<double>(burst)),
+      last_(Clock::now()) {}
+
+LogBudget::~LogBudget() {
+  if (dropped_ != 0) writeToSink(LogLevel::kNotice, suppressedLine(dropped_));
+}
+
+bool LogBudget::admit(Clock::time_point now, size_t* droppedBefore) {
+  std::lock_guard lock(mutex_);
+  if (now > last_) {
+    const double seconds = std::chrono::duration<double>(now - last_).count();
+    tokens_ = std::min(burst_, tokens_ + seconds * perSecond_);
+    last_ = now;
+  }
+  if (tokens_ < 1.0) {
+    ++dropped_;
+    return false;
+  }
+  tokens_ -= 1.0;
+  *droppedBefore = dropped_;
+  dropped_ = 0;
+  return true;
+}
+
+std::string LogBudget::suppressedLine(size_t dropped) const {
+  return format("%u log lines of %@ suppressed (more than %u a second)", dropped, label_,
+                static_cast<size_t>(perSecond_));
+}
+
+LogBudgetScope::LogBudgetScope(LogBudget* budget) : previous_(tlsBudget) {
+  tlsBudget = budget;
+}
+
+LogBudgetScope::~LogBudgetScope() {
+  tlsBudget = previous_;
 }
 
 LogSink setLogSink(LogSink sink) {

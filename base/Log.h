@@ -6,6 +6,8 @@
 // (foreground runs, demos). Tests install a capturing sink (LogCapture) and
 // assert on exact lines.
 
+#include <chrono>
+#include <cstddef>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -36,6 +38,51 @@ void vtlog(std::string_view fmt, const Args&... args) {
 // Replaces the process's sink; returns the previous one. An empty sink
 // restores the default (syslog, or stderr under VANTREL_LOG=stderr).
 LogSink setLogSink(LogSink sink);
+
+// How many lines one source (a peer's connection) may make the log take: a
+// burst, then a steady rate. A line over the budget is dropped and counted;
+// the next line admitted is preceded by one saying how many were dropped,
+// and so is the budget's end when lines were still being dropped. Shared by
+// the threads that write on the source's behalf.
+class LogBudget {
+ public:
+  using Clock = std::chrono::steady_clock;
+  // label names the source in the "suppressed" line ("client 123").
+  LogBudget(std::string label, size_t burst, size_t perSecond);
+  ~LogBudget();
+  LogBudget(const LogBudget&) = delete;
+  LogBudget& operator=(const LogBudget&) = delete;
+
+  // Charges one line at `now`. Returns whether it may be written; when it
+  // may, *droppedBefore is how many lines were dropped since the last one
+  // admitted.
+  bool admit(Clock::time_point now, size_t* droppedBefore);
+  // The line that reports `dropped` lines of this source as suppressed.
+  std::string suppressedLine(size_t dropped) const;
+
+ private:
+  const std::string label_;
+  const double burst_;
+  const double perSecond_;
+  std::mutex mutex_;
+  double tokens_;            // Guarded by mutex_.
+  Clock::time_point last_;   // Guarded by mutex_.
+  size_t dropped_ = 0;       // Guarded by mutex_.
+};
+
+// While it lives, lines of notice level or above that this thread writes are
+// charged to budget (null: none). Lines at info and debug level, which only
+// an operator's -v asks for, are not. Nests: the innermost scope charges.
+class LogBudgetScope {
+ public:
+  explicit LogBudgetScope(LogBudget* budget);
+  ~LogBudgetScope();
+  LogBudgetScope(const LogBudgetScope&) = delete;
+  LogBudgetScope& operator=(const LogBudgetScope&) = delete;
+
+ private:
+  LogBudget* previous_;
+};
 
 // Captures every line written while it lives (tests). Not nestable with
 // another sink change on a different thread.

@@ -43,6 +43,13 @@ inline constexpr size_t kMaxAnnotations = 16384;
 // request writes before the rest are summed up in one line.
 inline constexpr size_t kMaxItemLogLinesPerRequest = 8;
 
+// Lines one connection's messages and requests may make the daemon log: a
+// burst, then this many a second; the lines over it are counted in one
+// "<n> log lines of client <pid> suppressed" line. Info-level lines of -v
+// are not counted.
+inline constexpr size_t kPeerLogLinesBurst = 100;
+inline constexpr size_t kPeerLogLinesPerSecond = 10;
+
 // An "access" reply carries one token per UUID, each at most
 // kMaxSandboxTokenLength long; with room for the rest of the reply, the
 // largest allowed one fits in a frame.

@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include "base/Format.h"
+#include "daemon/Limits.h"
 #include "daemon/Transaction.h"
 #include "daemon/VTDServer.h"
 #include "lmo/Protocol.h"
@@ -29,6 +30,8 @@ VTDLmoClient::~VTDLmoClient() = default;
 void VTDLmoClient::identifyPeer(const lmo::Connection& connection) {
   pid_ = connection.pid();
   uid_ = connection.uid();
+  logBudget_ = std::make_unique<base::LogBudget>(base::format("client %d", pid_),
+                                                 kPeerLogLinesBurst, kPeerLogLinesPerSecond);
   const std::optional<std::string> executable = platform::processExecutablePath(pid_);
   if (executable) {
     bundle_ = model::VTBundle::initWithExecutableURL(model::FileUrl::fromPath(*executable));
@@ -47,6 +50,7 @@ void VTDLmoClient::identifyPeer(const lmo::Connection& connection) {
 }
 
 void VTDLmoClient::handleEvent(const lmo::Event& event) {
+  base::LogBudgetScope charged(logBudget_.get());
   if (const lmo::IncomingMessage* message = event.message()) {
     handleMessage(*message);
     return;
@@ -68,6 +72,7 @@ void VTDLmoClient::handleMessage(const lmo::IncomingMessage& message) {
   std::shared_ptr<Transaction> transaction =
       Transaction::initWithRequest(message, shared_from_this());
   server_->submitWork([transaction] {
+    base::LogBudgetScope charged(transaction->client()->logBudget());
     transaction->client()->countRequest();
     transaction->dispatch();
   });

@@ -18,6 +18,7 @@
 #include <string_view>
 
 #include "base/Error.h"
+#include "base/Log.h"
 #include "lmo/Connection.h"
 #include "lmo/Value.h"
 #include "model/VTBundle.h"
@@ -84,6 +85,9 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   const platform::CodeSigningTaskPtr& task() const { return task_; }
   // Requests submitted so far. Service queue only.
   uint32_t requestCount() const;
+  // The lines this peer's messages and requests may make the daemon log
+  // (charged while they are handled); never null after initWithConnection.
+  base::LogBudget* logBudget() const { return logBudget_.get(); }
 
  private:
   VTDLmoClient() = default;
@@ -109,6 +113,7 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   // only while it still runs that file.
   std::optional<platform::FileIdentity> executable_;
   int pidfd_ = -1;  // the connection's, which outlives every request
+  std::unique_ptr<base::LogBudget> logBudget_;
 
   uint32_t requestCount_ = 0;  // Owned by the server's service queue.
 };

@@ -84,9 +84,14 @@ void VTDServer::cancelListenerForTest() {
   service_->cancel();
 }
 
-void VTDServer::logFormatArguments(int /*level*/, std::string_view fmt, const base::FormatArg* args,
+void VTDServer::logFormatArguments(int level, std::string_view fmt, const base::FormatArg* args,
                                    size_t count) const {
-  base::writeLog(base::LogLevel::kNotice, base::formatArgs(fmt, args, count));
+  // Debug lines (what -v adds) go out at info level, so a peer's log budget
+  // never hides what the operator asked to see.
+  const base::LogLevel priority =
+      level >= static_cast<int>(base::LogLevel::kInfo) ? base::LogLevel::kInfo
+                                                        : base::LogLevel::kNotice;
+  base::writeLog(priority, base::formatArgs(fmt, args, count));
 }
 
 void VTDServer::submitWork(std::function<void()> work) {

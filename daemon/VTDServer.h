@@ -86,7 +86,8 @@ class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelega
     if (verbose() != 0) emit(6, fmt, args...);
   }
   // Formats and writes one line; the result is never used as a format
-  // again. level is accepted for the log's sake and does not filter.
+  // again. level does not filter: 6 and above are written at info level,
+  // the rest at notice.
   void logFormatArguments(int level, std::string_view fmt, const base::FormatArg* args,
                           size_t count) const;
 

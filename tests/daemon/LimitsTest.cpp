@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -174,15 +176,81 @@ TEST_F(Limits, AnnotationsAreBoundedInSizeAndNumberAndARefusalStoresNothing) {
   EXPECT_EQ(server_->annotations()->annotationForIdentifier(kShare), std::nullopt);
 }
 
-TEST_F(Limits, AnUnknownOperatorIsLoggedOncePerRequest) {
+TEST_F(Limits, APeerLogsOneLinePerRequestAndNoMoreThanItsBudget) {
   base::LogCapture log;
-  const Value unknown = repeated(Value(std::string("?XYZ")), 3);
+  const std::string line = "unrecognized match operator:?XYZ";
   // Two candidates, three elements each: one line.
-  EXPECT_EQ(errorOf(request(
-                protocol::kRequestMatch,
-                {{protocol::kKeyRules, Value(Dictionary{{"QXExtensionIdentifier", unknown}})}})),
-            Expected(0, ""));
-  EXPECT_EQ(log.count("unrecognized match operator:?XYZ"), 1u);
+  const Dictionary rules{
+      {protocol::kKeyRules,
+       Value(Dictionary{{"QXExtensionIdentifier", repeated(Value(std::string("?XYZ")), 3)}})}};
+  ASSERT_EQ(errorOf(request(protocol::kRequestMatch, rules)), Expected(0, ""));
+  EXPECT_EQ(log.count(line), 1u);
+
+  // One connection asking for a line again and again gets its burst and
+  // what its rate refills meanwhile; the rest is dropped and counted.
+  const auto flooder = connect();
+  const size_t requests = kPeerLogLinesBurst * 2;
+  const auto start = std::chrono::steady_clock::now();
+  for (size_t i = 0; i < requests; ++i) {
+    ASSERT_EQ(errorOf(request(protocol::kRequestMatch, rules, flooder)), Expected(0, "")) << i;
+  }
+  const double seconds =
+      std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+  const size_t logged = log.count(line) - 1;
+  EXPECT_GE(logged, kPeerLogLinesBurst);
+  EXPECT_LE(logged, kPeerLogLinesBurst + 1 + static_cast<size_t>(seconds * kPeerLogLinesPerSecond));
+
+  // Other connections keep their own budget.
+  ASSERT_EQ(errorOf(request(protocol::kRequestMatch, rules)), Expected(0, ""));
+  EXPECT_EQ(log.count(line), logged + 2);
+
+  // Every dropped line is accounted for, at the latest when the flooder
+  // goes away.
+  flooder->cancel();
+  const std::regex suppressed(base::format("(\\d+) log lines of client %d suppressed \\(more "
+                                           "than %u a second\\)",
+                                           ::getpid(), kPeerLogLinesPerSecond));
+  const auto droppedLines = [&] {
+    size_t total = 0;
+    for (const std::string& l : log.lines()) {
+      std::smatch m;
+      if (std::regex_match(l, m, suppressed)) total += std::stoul(m[1]);
+    }
+    return total;
+  };
+  EXPECT_TRUE(eventually([&] { return droppedLines() == requests - logged; }))
+      << droppedLines() << " of " << requests - logged;
+}
+
+TEST(LogBudget, AdmitsABurstThenARateAndCountsWhatItDrops) {
+  using Clock = base::LogBudget::Clock;
+  base::LogCapture log;
+  const Clock::time_point t0 = Clock::now() + std::chrono::seconds(1);
+  {
+    base::LogBudget budget("peer", 3, 2);
+    size_t dropped = 99;
+    struct Step {
+      double at;  // seconds after t0
+      bool admitted;
+      size_t droppedBefore;  // when admitted
+    };
+    const Step steps[] = {
+        {0, true, 0},    {0, true, 0},   {0, true, 0},  {0, false, 0},  {0.1, false, 0},
+        {0.5, true, 2},  {0.5, false, 0}, {10, true, 1}, {10, true, 0},  {10, true, 0},
+        {10, false, 0},  {9, false, 0},  // a clock going back refills nothing
+    };
+    for (const Step& step : steps) {
+      const auto at = t0 + std::chrono::duration_cast<Clock::duration>(
+                               std::chrono::duration<double>(step.at));
+      EXPECT_EQ(budget.admit(at, &dropped), step.admitted) << step.at;
+      if (step.admitted) {
+        EXPECT_EQ(dropped, step.droppedBefore) << step.at;
+      }
+    }
+  }
+  // The two lines still dropped when the budget ended are reported then.
+  EXPECT_EQ(log.lines(), std::vector<std::string>{"2 log lines of peer suppressed (more than 2 a "
+                                                  "second)"});
 }
 
 }  // namespace
