@@ -65,9 +65,9 @@ class LogBudget {
   const double burst_;
   const double perSecond_;
   std::mutex mutex_;
-  double tokens_;            // Guarded by mutex_.
-  Clock::time_point last_;   // Guarded by mutex_.
-  size_t dropped_ = 0;       // Guarded by mutex_.
+  double tokens_;           // Guarded by mutex_.
+  Clock::time_point last_;  // Guarded by mutex_.
+  size_t dropped_ = 0;      // Guarded by mutex_.
 };
 
 // While it lives, lines of notice level or above that this thread writes are

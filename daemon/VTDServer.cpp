@@ -88,9 +88,9 @@ void VTDServer::logFormatArguments(int level, std::string_view fmt, const base::
                                    size_t count) const {
   // Debug lines (what -v adds) go out at info level, so a peer's log budget
   // never hides what the operator asked to see.
-  const base::LogLevel priority =
-      level >= static_cast<int>(base::LogLevel::kInfo) ? base::LogLevel::kInfo
-                                                        : base::LogLevel::kNotice;
+  const base::LogLevel priority = level >= static_cast<int>(base::LogLevel::kInfo)
+                                      ? base::LogLevel::kInfo
+                                      : base::LogLevel::kNotice;
   base::writeLog(priority, base::formatArgs(fmt, args, count));
 }
 

@@ -207,9 +207,10 @@ TEST_F(Limits, APeerLogsOneLinePerRequestAndNoMoreThanItsBudget) {
   // Every dropped line is accounted for, at the latest when the flooder
   // goes away.
   flooder->cancel();
-  const std::regex suppressed(base::format("(\\d+) log lines of client %d suppressed \\(more "
-                                           "than %u a second\\)",
-                                           ::getpid(), kPeerLogLinesPerSecond));
+  const std::regex suppressed(
+      base::format("(\\d+) log lines of client %d suppressed \\(more "
+                   "than %u a second\\)",
+                   ::getpid(), kPeerLogLinesPerSecond));
   const auto droppedLines = [&] {
     size_t total = 0;
     for (const std::string& l : log.lines()) {
@@ -235,13 +236,13 @@ TEST(LogBudget, AdmitsABurstThenARateAndCountsWhatItDrops) {
       size_t droppedBefore;  // when admitted
     };
     const Step steps[] = {
-        {0, true, 0},    {0, true, 0},   {0, true, 0},  {0, false, 0},  {0.1, false, 0},
-        {0.5, true, 2},  {0.5, false, 0}, {10, true, 1}, {10, true, 0},  {10, true, 0},
-        {10, false, 0},  {9, false, 0},  // a clock going back refills nothing
+        {0, true, 0},   {0, true, 0},    {0, true, 0},  {0, false, 0}, {0.1, false, 0},
+        {0.5, true, 2}, {0.5, false, 0}, {10, true, 1}, {10, true, 0}, {10, true, 0},
+        {10, false, 0}, {9, false, 0},  // a clock going back refills nothing
     };
     for (const Step& step : steps) {
-      const auto at = t0 + std::chrono::duration_cast<Clock::duration>(
-                               std::chrono::duration<double>(step.at));
+      const auto at =
+          t0 + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(step.at));
       EXPECT_EQ(budget.admit(at, &dropped), step.admitted) << step.at;
       if (step.admitted) {
         EXPECT_EQ(dropped, step.droppedBefore) << step.at;
