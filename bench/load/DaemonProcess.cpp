@@ -100,11 +100,17 @@ base::Result<std::unique_ptr<DaemonProcess>> DaemonProcess::start(const DaemonCo
   if (log < 0 || input < 0) return failure("cannot open " + daemon->log_);
 
   daemon->started_ = Clock::now();
+  const pid_t parent = ::getpid();
   daemon->pid_ = ::fork();
   if (daemon->pid_ == 0) {
+    // A benchmark that dies (a sanitizer's report ends it at once) must not
+    // leave its daemon behind, holding the pipe a test runner reads to its
+    // end.
+    dieWithParent(parent);
     // The benchmark ignores SIGPIPE; the daemon must be seen to cope alone.
     ::signal(SIGPIPE, SIG_DFL);
     ::dup2(input, STDIN_FILENO);
+    ::dup2(log, STDOUT_FILENO);
     ::dup2(log, STDERR_FILENO);
     ::execve(argv[0], argv.data(), envp.data());
     ::_exit(127);

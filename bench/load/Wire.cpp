@@ -74,8 +74,9 @@ void setFrameInReplyTo(std::span<uint8_t> frame, uint64_t id) {
 uint8_t* FrameSplitter::space(size_t size) {
   if (begin_ == end_) begin_ = end_ = 0;
   if (buffer_.size() - end_ < size) {
-    // Move the unfinished frame to the front before growing.
-    std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
+    // Move the unfinished frame to the front before growing (an empty
+    // buffer has no data pointer to move from).
+    if (end_ != begin_) std::memmove(buffer_.data(), buffer_.data() + begin_, end_ - begin_);
     end_ -= begin_;
     begin_ = 0;
     if (buffer_.size() - end_ < size) buffer_.resize(end_ + size);

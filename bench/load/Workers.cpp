@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/epoll.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -219,8 +220,10 @@ base::Result<std::vector<ClientReport>> runClients(int clients, const std::funct
   for (int i = 0; i < clients; ++i) {
     int report[2];
     if (::pipe2(report, O_CLOEXEC) != 0) break;
+    const pid_t parent = ::getpid();
     const pid_t pid = ::fork();
     if (pid == 0) {
+      dieWithParent(parent);
       ::close(ready[0]);
       ::close(go[1]);
       ::close(report[0]);
@@ -264,15 +267,28 @@ base::Result<std::vector<ClientReport>> runClients(int clients, const std::funct
 }
 
 pid_t startAnswerer(int fd, const Bytes& reply) {
+  const pid_t parent = ::getpid();
   const pid_t pid = ::fork();
-  if (pid == 0) answer(fd, reply);
+  if (pid == 0) {
+    dieWithParent(parent);
+    answer(fd, reply);
+  }
   return pid;
 }
 
 pid_t startEpollServer(int listener, const Bytes& reply) {
+  const pid_t parent = ::getpid();
   const pid_t pid = ::fork();
-  if (pid == 0) serveEpoll(listener, reply);
+  if (pid == 0) {
+    dieWithParent(parent);
+    serveEpoll(listener, reply);
+  }
   return pid;
+}
+
+void dieWithParent(pid_t parent) {
+  ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+  if (::getppid() != parent) ::_exit(127);
 }
 
 void stopChild(pid_t pid) {

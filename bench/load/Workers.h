@@ -54,6 +54,9 @@ pid_t startEpollServer(int listener, const Bytes& reply);
 
 // Ends a child of ours: SIGTERM, then SIGKILL if it has not exited within a
 // few seconds; reaps it either way.
+// In a child just forked from parent: dies with it (SIGKILL), so a
+// benchmark that is killed or aborts leaves no process behind.
+void dieWithParent(pid_t parent);
 void stopChild(pid_t pid);
 
 // The p-th percentile (0..1) of sorted samples; 0 for none.
