@@ -188,21 +188,44 @@ base::Error posixError(int err, std::string_view what, const std::string& path) 
   return base::Error{kPosixErrorDomain, err, base::format("%s %s: %s", what, path, text)};
 }
 
-base::Result<void> writeFileAtomically(const std::string& path, std::string_view bytes,
-                                       mode_t mode) {
-  if (path.empty() || path.back() == '/') return posixError(EINVAL, "cannot write", path);
-  const std::string dir = directoryOf(path);
-  TemporaryFile temp(dir, baseNameOf(path));
+namespace {
+
+// Creates temp and fills it with bytes, synced, with mode; errors name path.
+base::Result<void> writeTemporary(TemporaryFile& temp, const std::string& path,
+                                  std::string_view bytes, mode_t mode) {
   if (int err = temp.create()) return posixError(err, "cannot create a temporary file for", path);
   if (int err = writeAll(temp.fd(), bytes)) return posixError(err, "cannot write", path);
   if (::fchmod(temp.fd(), mode) != 0) return posixError(errno, "cannot set the mode of", path);
   if (::fsync(temp.fd()) != 0) return posixError(errno, "cannot sync", path);
   if (int err = temp.close()) return posixError(err, "cannot write", path);
+  return base::Result<void>::success();
+}
+
+}  // namespace
+
+base::Result<void> writeFileAtomically(const std::string& path, std::string_view bytes,
+                                       mode_t mode) {
+  if (path.empty() || path.back() == '/') return posixError(EINVAL, "cannot write", path);
+  const std::string dir = directoryOf(path);
+  TemporaryFile temp(dir, baseNameOf(path));
+  VT_TRY(writeTemporary(temp, path, bytes, mode));
   if (::rename(temp.name().c_str(), path.c_str()) != 0)
     return posixError(errno, "cannot replace", path);
   temp.commit();
   // The new contents are in place; a failure here only means they may not
   // survive a crash of the machine.
+  if (int err = syncDirectory(dir)) return posixError(err, "cannot sync the directory of", path);
+  return base::Result<void>::success();
+}
+
+base::Result<void> createFileAtomically(const std::string& path, std::string_view bytes,
+                                        mode_t mode) {
+  if (path.empty() || path.back() == '/') return posixError(EINVAL, "cannot create", path);
+  const std::string dir = directoryOf(path);
+  TemporaryFile temp(dir, baseNameOf(path));  // removed when it goes, linked or not
+  VT_TRY(writeTemporary(temp, path, bytes, mode));
+  if (::link(temp.name().c_str(), path.c_str()) != 0)
+    return posixError(errno, "cannot create", path);
   if (int err = syncDirectory(dir)) return posixError(err, "cannot sync the directory of", path);
   return base::Result<void>::success();
 }

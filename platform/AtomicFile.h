@@ -33,6 +33,14 @@ inline constexpr std::string_view kTemporaryFileMarker = ".vt-tmp-";
 base::Result<void> writeFileAtomically(const std::string& path, std::string_view bytes,
                                        mode_t mode = 0644);
 
+// Creates path with bytes unless a file of that name exists: written and
+// synced under a temporary name as above, then published with link(), which
+// succeeds for exactly one of several racing writers and, unlike an O_EXCL
+// create, never shows a half-written file. Errors as writeFileAtomically's;
+// EEXIST (domain "POSIX") when path exists.
+base::Result<void> createFileAtomically(const std::string& path, std::string_view bytes,
+                                        mode_t mode = 0600);
+
 // The pid of the writer whose temporary file fileName (one name, without
 // directory) is; nullopt for a name of any other form.
 std::optional<pid_t> temporaryFileWriter(std::string_view fileName);

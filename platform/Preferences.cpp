@@ -136,6 +136,9 @@ base::Result<void> Preferences::setValue(std::string_view key, const lmo::Value&
                                     err.description())};
   }
   const lmo::Dictionary updated = values_.setting(key, value);
+  // Writers take turns under the lock, so what an earlier writer killed
+  // half-way left can go now.
+  (void)removeStaleTemporaryFiles(directory_, domain_ + ".plist");
   VT_TRY(writePropertyListFile(path_, lmo::Value(updated), kFileMode));
   values_ = updated;
   // The next synchronize() reads the file back and so learns its new stamp.

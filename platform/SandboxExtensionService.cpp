@@ -14,6 +14,7 @@
 #include <set>
 #include <string_view>
 
+#include "platform/AtomicFile.h"
 #include "platform/Digest.h"
 #include "platform/FileStamp.h"
 #include "platform/Paths.h"
@@ -173,25 +174,17 @@ int readSecret(const std::string& path, std::string* secret) {
   return err;
 }
 
-// Makes a fresh secret and publishes it with link(), which, like
-// O_CREAT|O_EXCL, succeeds for exactly one of several racing processes; unlike
-// a direct O_EXCL create it never shows a half-written file, so the losers can
-// read the winner's secret straight away. 0, EEXIST (lost the race) or errno.
+// Makes a fresh secret and publishes it whole, for exactly one of several
+// racing processes, so the losers can read the winner's secret straight
+// away. 0, EEXIST (lost the race) or errno.
 int createSecret(const std::string& path) {
   uint8_t bytes[kSandboxSecretBytes];
   if (int err = randomBytes(bytes, sizeof bytes)) return err;
-  std::string temp = path + ".XXXXXX";
-  const int fd = ::mkostemp(temp.data(), O_CLOEXEC);  // mode 0600
-  if (fd < 0) return errno;
-  int err = 0;
-  errno = 0;  // a short write sets none
-  if (::write(fd, bytes, sizeof bytes) != static_cast<ssize_t>(sizeof bytes) || ::fsync(fd) != 0) {
-    err = errno != 0 ? errno : EIO;
-  }
-  if (::close(fd) != 0 && err == 0) err = errno;
-  if (err == 0 && ::link(temp.c_str(), path.c_str()) != 0) err = errno;
-  ::unlink(temp.c_str());
-  return err;
+  // What a creation killed half-way left beside the secret.
+  (void)removeStaleTemporaryFiles(stateDirectory(), kSandboxSecretFileName);
+  const base::Result<void> created = createFileAtomically(
+      path, std::string_view(reinterpret_cast<const char*>(bytes), sizeof bytes), 0600);
+  return created.has_value() ? 0 : static_cast<int>(created.error().code);
 }
 
 // The secret, made on first use; 0 or errno.

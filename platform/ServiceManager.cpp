@@ -294,6 +294,8 @@ ServiceManager::~ServiceManager() {
 }
 
 void ServiceManager::load() {
+  // What a save of the table killed half-way left (no directory yet: none).
+  (void)removeStaleTemporaryFiles(directory_, kFileName);
   base::Result<lmo::Value> file = readPropertyListFile(path_);
   if (!file.has_value() && file.error().domain == kPosixErrorDomain &&
       file.error().code == ENOENT) {
@@ -345,7 +347,12 @@ void ServiceManager::adoptLoadedHosts(Table& loaded) {
                                   written.error().description()));
     }
   }
-  for (const auto& [pid, host] : hosts_) watcher_->watch(host);
+  for (const auto& [pid, host] : hosts_) {
+    // The hosts that outlived the last daemon keep their directories; a
+    // description it was writing when killed is left there half-way.
+    (void)removeStaleTemporaryFiles(launchDirectoryPath(directory_, pid));
+    watcher_->watch(host);
+  }
 }
 
 base::Result<void> ServiceManager::persist(const Table& table) {

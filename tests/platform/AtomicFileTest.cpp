@@ -62,17 +62,19 @@ TEST(AtomicFile, FailureLeavesTheOldFileAndNoTemporaries) {
   }
 }
 
-// The pid of a process that has exited and been reaped.
-pid_t deadPid() {
-  const pid_t child = ::fork();
-  if (child == 0) ::_exit(0);
-  ::waitpid(child, nullptr, 0);
-  return child;
-}
-
-std::string temporaryOf(const std::string& file, pid_t pid, int sequence) {
-  return "." + file + std::string(kTemporaryFileMarker) + std::to_string(pid) + "-" +
-         std::to_string(sequence);
+TEST(AtomicFile, CreatesOnlyWhatDoesNotExistAndLeavesNoTemporary) {
+  testing::TempDir dir;
+  const std::string path = dir.file("secret");
+  ::umask(022);
+  ASSERT_TRUE(createFileAtomically(path, std::string("one\0", 4), 0640).has_value());
+  EXPECT_EQ(contentsOf(path), std::string("one\0", 4));
+  EXPECT_EQ(modeOf(path), 0640u);
+  const auto again = createFileAtomically(path, "two");
+  ASSERT_FALSE(again.has_value());
+  EXPECT_EQ(again.error().code, EEXIST);
+  EXPECT_EQ(contentsOf(path), std::string("one\0", 4));
+  EXPECT_EQ(entryCount(dir.path()), 1);
+  EXPECT_EQ(createFileAtomically(dir.file("missing/f"), "x").error().code, ENOENT);
 }
 
 TEST(AtomicFile, WritesUnderARecognisableTemporaryName) {

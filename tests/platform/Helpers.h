@@ -6,6 +6,8 @@
 #include <gtest/gtest.h>
 #include <plist/plist.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -17,6 +19,7 @@
 #include <string>
 #include <utility>
 
+#include "platform/AtomicFile.h"
 #include "tests/support/PeerProcess.h"
 #include "tests/support/ScopedEnvironment.h"
 #include "tests/support/TempDir.h"
@@ -92,6 +95,20 @@ inline std::unique_ptr<testing::PeerProcess> startSleepingPeer(const std::string
     return nullptr;
   }
   return peer;
+}
+
+// The pid of a process that has exited and been reaped.
+inline pid_t deadPid() {
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(0);
+  ::waitpid(child, nullptr, 0);
+  return child;
+}
+
+// The name writeFileAtomically gives its temporaries.
+inline std::string temporaryOf(const std::string& file, pid_t pid, int sequence) {
+  return "." + file + std::string(kTemporaryFileMarker) + std::to_string(pid) + "-" +
+         std::to_string(sequence);
 }
 
 }  // namespace vantrel::platform

@@ -90,6 +90,12 @@ TEST_F(PreferencesTest, ConcurrentWritersLoseNoUpdate) {
   // Each thread has its own object, as separate processes would: every write
   // must start from the file as the previous writer left it.
   constexpr int kWriters = 4, kKeysEach = 10;
+  // What a writer killed half-way left goes at the next write.
+  const std::string hostDirectory = dir_.file(preferencesHostName());
+  std::filesystem::create_directories(hostDirectory);
+  const std::string leftover =
+      hostDirectory + "/" + temporaryOf(std::string(kDomain) + ".plist", deadPid(), 1);
+  std::ofstream(leftover) << "partial";
   std::vector<std::thread> threads;
   for (int t = 0; t < kWriters; ++t) {
     threads.emplace_back([t] {
@@ -101,6 +107,7 @@ TEST_F(PreferencesTest, ConcurrentWritersLoseNoUpdate) {
     });
   }
   for (std::thread& t : threads) t.join();
+  EXPECT_FALSE(std::filesystem::exists(leftover));
   Preferences reader(kDomain);
   for (int k = 0; k < kWriters * kKeysEach; ++k) {
     EXPECT_EQ(reader.valueForKey(std::to_string(k)), lmo::Value::integer(k % kKeysEach)) << k;

@@ -118,6 +118,10 @@ TEST_F(SandboxExtension, IssueFailsForPathsThatCannotBeRead) {
 
 TEST_F(SandboxExtension, SecretIsPrivateMadeOnceAndReused) {
   const std::string file = dir_.write("f", "contents");
+  // What a creation killed half-way left goes when the secret is made.
+  ASSERT_EQ(::mkdir(stateDir_.c_str(), 0700), 0);
+  const std::string leftover = stateDir_ + "/" + temporaryOf(kSandboxSecretFileName, deadPid(), 1);
+  std::ofstream(leftover) << "partial";
   // Racing first uses agree on one secret.
   std::vector<std::string> tokens(8);
   std::vector<std::thread> threads;

@@ -263,7 +263,17 @@ TEST(ServiceManager, TheTableOutlivesTheInstanceButNotItsHosts) {
   // Exits while no manager runs.
   gone.exit();
   fs::remove(f.launchFile(live, "a"));
+  // What saves killed half-way left, of the table and of the live host's
+  // description.
+  const pid_t dead = deadPid();
+  const std::string launchDirectory = launchDirectoryPath(f.dir.path().string(), live.pid);
+  const std::string leftovers[] = {
+      f.dir.write(temporaryOf("services.plist", dead, 1), "partial"),
+      f.dir.write(fs::relative(launchDirectory, f.dir.path()).string() + "/" +
+                      temporaryOf(fs::path(f.launchFile(live, "a")).filename().string(), dead, 2),
+                  "partial")};
   ServiceManager second(f.dir.path().string());
+  for (const std::string& leftover : leftovers) EXPECT_FALSE(fs::exists(leftover)) << leftover;
   EXPECT_EQ(second.registrations(), Registrations{f.service("a", "1", live)});
   // The pruned table was written back: the file alone no longer names b.
   EXPECT_EQ(servicesOnDisk(second), 1u);
