@@ -6,6 +6,7 @@ repository)."""
 from __future__ import annotations
 
 import os
+import signal
 import plistlib
 import shutil
 import socket
@@ -99,6 +100,30 @@ class Daemon:
     def signal(self, number: int) -> None:
         assert self.process is not None
         self.process.send_signal(number)
+
+    def pause(self) -> None:
+        """SIGSTOP, returning once every thread has stopped: the kernel
+        wakes one thread to stop the others, and on a busy machine another
+        could still answer a request sent meanwhile."""
+        assert self.process is not None
+        self.process.send_signal(signal.SIGSTOP)
+        tasks = f"/proc/{self.process.pid}/task"
+        deadline = time.monotonic() + START_TIMEOUT
+        while time.monotonic() < deadline:
+            states = []
+            for task in os.listdir(tasks):
+                try:
+                    with open(os.path.join(tasks, task, "stat")) as stat:
+                        states.append(stat.read().rsplit(")", 1)[1].split()[0])
+                except OSError:
+                    pass  # a thread that has just ended
+            if states and all(state in ("T", "t") for state in states):
+                return
+            time.sleep(0.005)
+        raise RuntimeError("vantreld did not stop")
+
+    def resume(self) -> None:
+        self.signal(signal.SIGCONT)
 
     def remove(self) -> None:
         if self.process is not None and self.process.poll() is None:

@@ -64,7 +64,7 @@ class DaemonGoneTest(unittest.TestCase):
     def kill_soon(self) -> None:
         """Freezes the daemon so that requests stay unanswered, and kills it
         a moment later."""
-        self.daemon.signal(signal.SIGSTOP)
+        self.daemon.pause()
         threading.Timer(0.3, self.daemon.signal, [signal.SIGKILL]).start()
 
     def test_sync_call_fails_when_the_daemon_dies(self) -> None:
@@ -98,18 +98,18 @@ class DaemonGoneTest(unittest.TestCase):
         # the reply to the next request.
         def sync() -> dict:
             with Client(self.daemon.socket) as client:
-                self.daemon.signal(signal.SIGSTOP)
+                self.daemon.pause()
                 with self.assertRaises(TimeoutError):
                     client.bulk(timeout=0.2)
-                self.daemon.signal(signal.SIGCONT)
+                self.daemon.resume()
                 return client.explain()
 
         async def asynchronous() -> dict:
             async with await AsyncClient.connect(self.daemon.socket) as client:
-                self.daemon.signal(signal.SIGSTOP)
+                self.daemon.pause()
                 with self.assertRaises(TimeoutError):
                     await client.bulk(timeout=0.2)
-                self.daemon.signal(signal.SIGCONT)
+                self.daemon.resume()
                 return await client.explain()
 
         for name, run in [("sync", sync), ("async", lambda: asyncio.run(asynchronous()))]:
