@@ -315,22 +315,34 @@ bool validEntities(std::string_view text) {
   return true;
 }
 
-bool validInteger(std::string_view text) {
-  bool negative = false;
+// The integer as libplist must be given it, or nullopt when it is not one.
+// Compat: libplist reads integers with strtoull's base 0, so leading zeros
+// would make a decimal number octal ("010" is 8, "08" is 0); property lists
+// are decimal, and the zeros are dropped before libplist sees them.
+std::optional<std::string> canonicalInteger(std::string_view text) {
+  std::string out;
   if (!text.empty() && (text[0] == '-' || text[0] == '+')) {
-    negative = text[0] == '-';
+    if (text[0] == '-') out += '-';
     text.remove_prefix(1);
   }
+  const bool negative = !out.empty();
   int base = 10;
   if (text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X')) {
     base = 16;
+    out += "0x";
     text.remove_prefix(2);
   }
-  if (text.empty() || !allOf(text, base == 16 ? isHexDigit : isDigit)) return false;
+  if (text.empty() || !allOf(text, base == 16 ? isHexDigit : isDigit)) return std::nullopt;
   uint64_t magnitude = 0;
   const auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), magnitude, base);
-  if (ec != std::errc() || end != text.data() + text.size()) return false;  // above UINT64_MAX
-  return !negative || magnitude <= uint64_t{1} << 63;
+  if (ec != std::errc() || end != text.data() + text.size()) return std::nullopt;  // > UINT64_MAX
+  if (negative && magnitude > uint64_t{1} << 63) return std::nullopt;
+  if (base == 10) {
+    const size_t first = text.find_first_not_of('0');
+    text.remove_prefix(first == std::string_view::npos ? text.size() - 1 : first);
+  }
+  out += text;
+  return out;
 }
 
 // Decimal notation, or inf, infinity and nan in any case, with a sign.
@@ -392,10 +404,14 @@ std::optional<base::Error> XmlPreflight::leaf(const Tag& tag) {
     ok = validBase64(text);
   } else if (name != "key" && name != "string") {
     const std::string_view value = trimmed(text);
-    ok = name == "integer" ? validInteger(value)
-         : name == "real"  ? validReal(value)
-                           : validDate(value);
-    text = std::string(value);
+    if (name == "integer") {
+      std::optional<std::string> integer = canonicalInteger(value);
+      ok = integer.has_value();
+      text = std::move(integer).value_or(std::string());
+    } else {
+      ok = name == "real" ? validReal(value) : validDate(value);
+      text = std::string(value);
+    }
   }
   if (!ok) return malformed("bad value");
   out_ += '<';

@@ -141,6 +141,13 @@ TEST(PropertyList, PinsLibplistLimits) {
   // Reading keeps such a value unsigned.
   auto read = readPropertyList(xmlPlist("<integer>18446744073709551615</integer>"));
   EXPECT_EQ(read.value().getIfUInt64(), UINT64_MAX);
+  // libplist alone would read leading zeros as octal ("010" as 8, "08" as 0).
+  for (const auto& [text, value] :
+       {std::pair("010", 10), std::pair("-08", -8), std::pair("000", 0), std::pair("0x010", 16)}) {
+    EXPECT_EQ(readPropertyList(xmlPlist("<integer>" + std::string(text) + "</integer>")).value(),
+              Value::integer(value))
+        << text;
+  }
 
   // Dates beyond int32 seconds from 2001 read correctly but cannot be written.
   for (const auto& [text, seconds] : {std::pair("1900-01-01T00:00:00Z", -2208988800.0),
