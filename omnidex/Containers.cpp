@@ -1,9 +1,12 @@
 #include "omnidex/Containers.h"
 
+#include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include <cerrno>
 #include <filesystem>
+#include <string_view>
 #include <system_error>
 
 #include "platform/AtomicFile.h"
@@ -46,6 +49,25 @@ base::Result<std::string> Containers::ensure(const base::Uuid& uuid) const {
   VT_TRY(makePrivateDirectory(path));
   VT_TRY(makePrivateDirectory(path + "/" + kTmpName));
   return path;
+}
+
+std::unordered_set<std::string> Containers::existing() const {
+  std::unordered_set<std::string> names;
+  DIR* dir = ::opendir(root_.c_str());
+  if (dir == nullptr) return names;
+  while (const dirent* entry = ::readdir(dir)) {
+    const std::string_view name = entry->d_name;
+    if (name == "." || name == "..") continue;
+    bool directory = entry->d_type == DT_DIR;
+    if (entry->d_type == DT_UNKNOWN) {
+      struct stat st;
+      directory = ::fstatat(::dirfd(dir), entry->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+                  S_ISDIR(st.st_mode);
+    }
+    if (directory) names.emplace(name);
+  }
+  ::closedir(dir);
+  return names;
 }
 
 base::Result<void> Containers::remove(const base::Uuid& uuid) const {

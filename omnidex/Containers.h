@@ -4,6 +4,7 @@
 // bundle-controlled text ever becomes part of the path.
 
 #include <string>
+#include <unordered_set>
 #include <utility>
 
 #include "base/Result.h"
@@ -25,6 +26,12 @@ class Containers {
   // path. A symbolic link or other non-directory in the way is an error, not
   // followed. Errors: domain "POSIX".
   base::Result<std::string> ensure(const base::Uuid& uuid) const;
+
+  // The names of the directories in root now (the containers that exist),
+  // read in one pass; empty when root cannot be read. Loading the registry
+  // takes a container named here as it is, instead of checking each one
+  // with four system calls.
+  std::unordered_set<std::string> existing() const;
 
   // Removes the container of uuid with everything in it; a missing container
   // is no error. Symbolic links inside are removed, not followed.

@@ -44,8 +44,9 @@ Omnidex::State::State(std::vector<ScanRoot> scanRoots, std::unique_ptr<Store> op
 base::Result<void> Omnidex::State::load() {
   std::lock_guard write(writeMutex);
   std::unique_lock index(indexMutex);
+  const std::unordered_set<std::string> existingContainers = containers.existing();
   return store->load(
-      [this](PlugInRow&& row) { loadPlugIn(std::move(row)); },
+      [&](PlugInRow&& row) { loadPlugIn(std::move(row), existingContainers); },
       [this](ApplicationRow&& row) { loadApplication(std::move(row)); },
       [](const std::string& path) { logUnreadableRow(path, "its UUID is not one"); });
 }
@@ -61,7 +62,8 @@ void Omnidex::State::loadApplication(ApplicationRow&& row) {
       ApplicationEntry{makeApplicationRecord(row.path, info), std::move(row.fingerprint), digest});
 }
 
-void Omnidex::State::loadPlugIn(PlugInRow&& row) {
+void Omnidex::State::loadPlugIn(PlugInRow&& row,
+                                const std::unordered_set<std::string>& existingContainers) {
   if (indexes.size() >= kMaxRegisteredPlugIns) {
     logUnreadableRow(row.path,
                      base::format("the registry holds %u plug-ins already", kMaxRegisteredPlugIns));
@@ -87,9 +89,12 @@ void Omnidex::State::loadPlugIn(PlugInRow&& row) {
     }
   }
   const PlugInIdentity identity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}};
-  PlugInRecordPtr record =
-      makePlugInRecord(row.path, metadata.value(), entitlements.value(), identity, app,
-                       containerOrLog(containers, row.uuid, row.path));
+  // Containers are made at registration; one removed since is made again.
+  std::optional<std::string> container = existingContainers.contains(row.uuid.string())
+                                             ? containers.pathFor(row.uuid)
+                                             : containerOrLog(containers, row.uuid, row.path);
+  PlugInRecordPtr record = makePlugInRecord(row.path, metadata.value(), entitlements.value(),
+                                            identity, app, std::move(container));
   indexes.put(PlugInEntry{std::move(record), row.isExplicit, std::move(row.fingerprint),
                           contentDigest(row.infoBytes, row.entitlementsBytes)});
 }

@@ -15,6 +15,7 @@
 #include <mutex>
 #include <shared_mutex>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "base/SerialQueue.h"
@@ -84,7 +85,7 @@ struct Omnidex::State {
   void deliver(const std::vector<PlugInRecordPtr>& uninstalled,
                const std::vector<PlugInRecordPtr>& installed);
   const ScanRoot* rootOf(const std::string& item) const;
-  void loadPlugIn(PlugInRow&& row);
+  void loadPlugIn(PlugInRow&& row, const std::unordered_set<std::string>& existingContainers);
   void loadApplication(ApplicationRow&& row);
 };
 

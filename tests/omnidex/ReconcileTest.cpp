@@ -75,10 +75,15 @@ TEST(OmnidexReconcile, FindsNewVanishedAndChangedBundlesAndKeepsUuids) {
   fs::remove_all(widget);
   writeBundle(share, plugInInfo("n.share", "p", Dictionary{{"KBBundleVersion", "2"}}));
   const std::string added = writeBundle(tree.plugIns() + "/New.plugin", plugInInfo("new", "p"));
+  // A container removed while no registry ran is made again when it opens.
+  fs::remove_all(tree.container(before[tool]));
 
   auto registry = tree.open();
   // Until it reconciles, the registry answers from its store.
   EXPECT_EQ(uuidsByPath(*registry), before);
+  EXPECT_TRUE(fs::is_directory(tree.container(before[tool]) + "/tmp"));
+  EXPECT_EQ(registry->plugInForUrl(tool)->dataContainerPath, tree.container(before[tool]));
+  EXPECT_EQ(registry->plugInForUrl(away)->dataContainerPath, tree.container(before[away]));
   auto observer = observe(*registry);
   registry->reconcile();
   EXPECT_EQ(observer->log(),
