@@ -99,6 +99,20 @@ void SerialQueue::sync(const Block& block) {
   waiter->cv.wait(lock, [&] { return waiter->finished; });
 }
 
+bool SerialQueue::tryRunHere(const Block& block) {
+  {
+    std::lock_guard lock(mutex_);
+    if (running_ || !tasks_.empty() || stopping_) return false;
+    running_ = true;
+  }
+  Task inlineTask{[&block] { block(); }, tls.held, nullptr};
+  runBlock(inlineTask);
+  std::lock_guard lock(mutex_);
+  running_ = false;
+  if (!tasks_.empty()) wake_.notify_one();
+  return true;
+}
+
 bool SerialQueue::isCurrent() const {
   return tls.current == this;
 }

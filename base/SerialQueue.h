@@ -48,6 +48,12 @@ class SerialQueue {
   // this queue (directly or through a chain of sync calls) stops the process.
   void sync(const Block& block);
 
+  // Runs block on this queue from the calling thread when the queue is idle
+  // (nothing running, nothing waiting) and returns true; otherwise returns
+  // false at once without running it. For a thread that must never wait
+  // (an I/O loop) to save the hand-off to the worker when it can.
+  bool tryRunHere(const Block& block);
+
   // True when the calling thread is running a block of this queue: one
   // thread-local load and a compare.
   bool isCurrent() const;

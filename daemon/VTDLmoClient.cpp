@@ -21,6 +21,9 @@ VTDLmoClientPtr VTDLmoClient::initWithConnection(std::shared_ptr<lmo::Connection
   client->identifyPeer(*connection);
   connection->setContext(client);
   connection->setEventHandler([client](const lmo::Event& event) { client->handleEvent(event); });
+  // A message only becomes a transaction handed to the service queue: the
+  // I/O thread may do that itself and spare a thread wake-up per request.
+  connection->setInlineMessageDelivery(true);
   connection->resume();
   return client;
 }

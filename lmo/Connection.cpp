@@ -231,6 +231,12 @@ void Connection::setTargetQueue(QueuePtr queue) {
   targetQueue_ = std::move(queue);
 }
 
+void Connection::setInlineMessageDelivery(bool enabled) {
+  std::lock_guard lock(mutex_);
+  VT_CHECK(!resumed_, "setInlineMessageDelivery after resume");
+  inlineMessageDelivery_ = enabled;
+}
+
 void Connection::setContext(std::shared_ptr<void> context) {
   std::lock_guard lock(mutex_);
   context_ = std::move(context);
@@ -619,25 +625,32 @@ void Connection::deliver(Event event, bool counted) {
     if (counted) noteAnswered();
     return;
   }
+  const bool mayRunHere = inlineMessageDelivery_ && event.message() != nullptr;
   if (!counted) {
-    enqueue(queue, [handler = std::move(handler), event = std::move(event)] { handler(event); });
+    enqueue(
+        queue, [handler = std::move(handler), event = std::move(event)] { handler(event); },
+        mayRunHere);
     return;
   }
-  enqueue(queue,
-          [self = shared_from_this(), handler = std::move(handler), event = std::move(event)] {
-            handler(event);
-            self->noteAnswered();
-          });
+  enqueue(
+      queue,
+      [self = shared_from_this(), handler = std::move(handler), event = std::move(event)] {
+        handler(event);
+        self->noteAnswered();
+      },
+      mayRunHere);
 }
 
-void Connection::enqueue(const QueuePtr& queue, std::function<void()> task) {
+void Connection::enqueue(const QueuePtr& queue, std::function<void()> task, bool mayRunHere) {
   bool schedule = false;
   {
     std::lock_guard lock(inboxMutex_);
     inbox_.push_back(std::move(task));
     schedule = !std::exchange(inboxScheduled_, true);
   }
-  if (schedule) queue->async([self = shared_from_this(), queue] { self->runInbox(queue); });
+  if (!schedule) return;
+  if (mayRunHere && queue->tryRunHere([this, &queue] { runInbox(queue); })) return;
+  queue->async([self = shared_from_this(), queue] { self->runInbox(queue); });
 }
 
 void Connection::runInbox(const QueuePtr& queue) {

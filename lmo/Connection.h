@@ -75,6 +75,13 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // or in the destructor when the connection was never resumed.
   void setFinalizer(Finalizer finalizer);
 
+  // Lets the I/O thread run the handler for a message itself, on the target
+  // queue, when that queue is idle, instead of waking the queue's worker;
+  // other events always go through the worker. Only for handlers that never
+  // wait (for this connection's I/O above all: a handler that sends a request
+  // and waits for its reply would wait for itself). Before resume().
+  void setInlineMessageDelivery(bool enabled);
+
   // Starts delivering events. An event handler must be set first. Calling it
   // again does nothing.
   void resume();
@@ -150,7 +157,9 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   // Runs task on queue after every task this connection handed it before,
   // holding at most one place in the queue at a time: connections take
   // turns, so one that sends a lot waits behind the others, not ahead.
-  void enqueue(const QueuePtr& queue, std::function<void()> task);
+  // mayRunHere: on the calling thread when the queue is idle and this
+  // connection has nothing waiting in it.
+  void enqueue(const QueuePtr& queue, std::function<void()> task, bool mayRunHere = false);
   // Runs the oldest task of the inbox, then gives up its place.
   void runInbox(const QueuePtr& queue);
   // Accounts the buffered input of an unfinished frame and its deadline.
@@ -215,6 +224,9 @@ class Connection : public IoSource, public std::enable_shared_from_this<Connecti
   std::mutex inboxMutex_;
   std::deque<std::function<void()>> inbox_;
   bool inboxScheduled_ = false;
+
+  // Set before resume(), then constant.
+  bool inlineMessageDelivery_ = false;
 };
 
 // "<connection pid=%d>" for log lines.
