@@ -14,8 +14,10 @@
 #include "daemon/VTDServer.h"
 #include "lmo/Message.h"
 #include "lmo/Protocol.h"
+#include "platform/DeviceRestrictions.h"
 #include "platform/PeerPaths.h"
 #include "platform/Probes.h"
+#include "platform/SandboxExtensionService.h"
 #include "registry/VTDPlugIn.h"
 
 namespace vantrel::daemon {
@@ -107,8 +109,11 @@ void Transaction::dispatch() {
     if (operation.type == *type) {
       if (operation.scope == Scope::kChangesState && !allowStateChange(*type)) return;
       // Rules are matched against every candidate: one request logs an
-      // unknown operator once, not once per candidate and element.
+      // unknown operator once, not once per candidate and element. Likewise
+      // it reads the device's restrictions and the token secret once.
       registry::MatchLogOnce logOnce;
+      platform::DeviceRestrictionsReadOnce restrictionsOnce;
+      platform::SandboxTokenBatch tokens;
       (this->*operation.run)();
       return;
     }

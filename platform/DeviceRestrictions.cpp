@@ -44,10 +44,36 @@ std::optional<int64_t> ratingOf(const lmo::Value& value) {
 
 }  // namespace
 
-std::optional<int64_t> maximumApplicationRating() {
+namespace {
+
+// This thread's DeviceRestrictionsReadOnce: whether one is open, and the
+// answer once read.
+struct ReadOnce {
+  bool active = false;
+  std::optional<std::optional<int64_t>> rating;
+};
+thread_local ReadOnce tlsReadOnce;
+
+std::optional<int64_t> readMaximumApplicationRating() {
   std::shared_ptr<Preferences> domain = restrictionsDomain();
   domain->synchronize();
   return ratingOf(domain->valueForKey(kMaxApplicationRatingKey));
+}
+
+}  // namespace
+
+std::optional<int64_t> maximumApplicationRating() {
+  if (!tlsReadOnce.active) return readMaximumApplicationRating();
+  if (!tlsReadOnce.rating) tlsReadOnce.rating = readMaximumApplicationRating();
+  return *tlsReadOnce.rating;
+}
+
+DeviceRestrictionsReadOnce::DeviceRestrictionsReadOnce() : outermost_(!tlsReadOnce.active) {
+  if (outermost_) tlsReadOnce.active = true;
+}
+
+DeviceRestrictionsReadOnce::~DeviceRestrictionsReadOnce() {
+  if (outermost_) tlsReadOnce = ReadOnce{};
 }
 
 base::Result<void> setMaximumApplicationRating(std::optional<int64_t> rating) {

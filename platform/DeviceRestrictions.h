@@ -24,6 +24,20 @@ inline constexpr const char* kMaxApplicationRatingKey = "maxApplicationRating";
 // beyond the signed 64-bit range is clamped to it.
 std::optional<int64_t> maximumApplicationRating();
 
+// While one lives, this thread reads the restrictions once, at its first
+// maximumApplicationRating(), and keeps the answer: a request is one check,
+// however many plug-ins it looks at. Nests (the outermost one counts).
+class DeviceRestrictionsReadOnce {
+ public:
+  DeviceRestrictionsReadOnce();
+  ~DeviceRestrictionsReadOnce();
+  DeviceRestrictionsReadOnce(const DeviceRestrictionsReadOnce&) = delete;
+  DeviceRestrictionsReadOnce& operator=(const DeviceRestrictionsReadOnce&) = delete;
+
+ private:
+  bool outermost_;
+};
+
 // Sets the highest application rating (nullopt removes the restriction) in
 // the domain's file, for every process that reads it. Errors as
 // Preferences::setValue, with the file left as it was.

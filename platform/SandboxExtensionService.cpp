@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+#include <cstring>
 #include <mutex>
 #include <set>
 #include <string_view>
@@ -199,6 +200,42 @@ int loadSecret(std::string* secret) {
   return readSecret(path, secret);
 }
 
+// What a SandboxTokenBatch keeps for its thread: the secret as read at its
+// first token, and nonces drawn kBatchNonces at a time.
+constexpr size_t kBatchNonces = 64;
+struct BatchState {
+  bool active = false;
+  bool secretRead = false;
+  int secretError = 0;
+  std::string secret;
+  uint8_t nonces[kBatchNonces * kNonceBytes] = {};
+  size_t noncesLeft = 0;
+};
+thread_local BatchState tlsBatch;
+
+int batchedSecret(std::string* secret) {
+  if (!tlsBatch.active) return loadSecret(secret);
+  if (!tlsBatch.secretRead) {
+    tlsBatch.secretError = loadSecret(&tlsBatch.secret);
+    tlsBatch.secretRead = true;
+  }
+  if (tlsBatch.secretError == 0) *secret = tlsBatch.secret;
+  return tlsBatch.secretError;
+}
+
+int batchedNonce(uint8_t* nonce) {
+  if (!tlsBatch.active) return nonceBytes(nonce, kNonceBytes);
+  if (tlsBatch.noncesLeft == 0) {
+    if (int err = nonceBytes(tlsBatch.nonces, sizeof tlsBatch.nonces)) return err;
+    tlsBatch.noncesLeft = kBatchNonces;
+  }
+  --tlsBatch.noncesLeft;
+  uint8_t* next = tlsBatch.nonces + tlsBatch.noncesLeft * kNonceBytes;
+  std::memcpy(nonce, next, kNonceBytes);
+  OPENSSL_cleanse(next, kNonceBytes);  // each nonce is handed out once
+  return 0;
+}
+
 std::string macFor(const std::string& secret, const uint8_t* nonce, const std::string& path) {
   std::string message(kMacDomain);
   message.push_back('\0');
@@ -214,7 +251,7 @@ std::string macFor(const std::string& secret, const uint8_t* nonce, const std::s
 // path once (an O_PATH open) and names what it found. A link name that is
 // not absolute (/proc missing, a deleted or detached file) falls back to
 // realpath. nullopt with errno when the path does not resolve.
-std::optional<std::string> canonicalPath(const std::string& path) {
+std::optional<std::string> resolveCanonical(const std::string& path) {
   const int fd = ::open(path.c_str(), O_PATH | O_CLOEXEC);
   if (fd < 0) return std::nullopt;
   char link[PATH_MAX];
@@ -310,19 +347,37 @@ int openReadOnly(const std::string& path) {
 
 }  // namespace
 
+std::optional<std::string> canonicalPath(const std::string& path) {
+  return resolveCanonical(path);
+}
+
 std::optional<std::string> sandbox_extension_issue_file(const std::string& path) {
-  std::optional<std::string> resolved = canonicalPath(path);
+  std::optional<std::string> resolved = resolveCanonical(path);
   if (!resolved) return std::nullopt;
-  const std::string& canonical = *resolved;
+  return sandbox_extension_issue_canonical_file(*resolved);
+}
+
+SandboxTokenBatch::SandboxTokenBatch() : outermost_(!tlsBatch.active) {
+  if (outermost_) tlsBatch.active = true;
+}
+
+SandboxTokenBatch::~SandboxTokenBatch() {
+  if (!outermost_) return;
+  OPENSSL_cleanse(tlsBatch.secret.data(), tlsBatch.secret.size());
+  OPENSSL_cleanse(tlsBatch.nonces, sizeof tlsBatch.nonces);
+  tlsBatch = BatchState{};
+}
+
+std::optional<std::string> sandbox_extension_issue_canonical_file(const std::string& canonical) {
   if (::faccessat(AT_FDCWD, canonical.c_str(), R_OK, AT_EACCESS) != 0) return std::nullopt;
 
   std::string secret;
-  if (int err = loadSecret(&secret)) {
+  if (int err = batchedSecret(&secret)) {
     errno = err;
     return std::nullopt;
   }
   uint8_t nonce[kNonceBytes];
-  if (int err = nonceBytes(nonce, sizeof nonce)) {
+  if (int err = batchedNonce(nonce)) {
     errno = err;
     return std::nullopt;
   }

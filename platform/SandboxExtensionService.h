@@ -32,6 +32,29 @@ inline constexpr size_t kSandboxSecretBytes = 32;
 // this process (EACCES) or the secret cannot be made.
 std::optional<std::string> sandbox_extension_issue_file(const std::string& path);
 
+// The canonical form of path (realpath's answer, in one kernel resolution
+// where /proc allows), or nullopt with errno when it does not resolve.
+std::optional<std::string> canonicalPath(const std::string& path);
+
+// As sandbox_extension_issue_file, for a path its caller already knows to be
+// canonical (canonicalPath's answer kept from earlier): no resolution.
+std::optional<std::string> sandbox_extension_issue_canonical_file(const std::string& canonical);
+
+// While one lives, the tokens this thread issues share one reading of the
+// secret and draw their nonces in bulk: a request that issues a token for
+// each plug-in it reports pays for those once. Nests (the outermost one
+// counts). A secret changed meanwhile applies from the next scope on.
+class SandboxTokenBatch {
+ public:
+  SandboxTokenBatch();
+  ~SandboxTokenBatch();
+  SandboxTokenBatch(const SandboxTokenBatch&) = delete;
+  SandboxTokenBatch& operator=(const SandboxTokenBatch&) = delete;
+
+ private:
+  bool outermost_;
+};
+
 // Verifies the token (format, HMAC) and opens the named path read-only
 // (O_RDONLY|O_CLOEXEC; directories open too). Returns a handle > 0, or -1
 // with errno (EINVAL for a malformed or forged token, the open's errno

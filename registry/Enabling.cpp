@@ -11,6 +11,7 @@
 #include "model/SandboxExtensionIssue.h"
 #include "model/VTBundle.h"
 #include "omnidex/PrivacyConsent.h"
+#include "platform/SandboxExtensionService.h"
 #include "platform/ServiceManager.h"
 #include "registry/VTDPlugIn.h"
 
@@ -57,7 +58,24 @@ lmo::Dictionary VTDPlugIn::issueResourceExtensions(const lmo::Value& resources) 
     const model::FileUrl target =
         *name == "." ? *bundle : model::FileUrl::fromPath(bundle->path() + "/" + *name);
     errno = 0;
-    if (std::optional<std::string> token = model::issue_read_extension(target)) {
+    std::optional<std::string> token;
+    if (*name == ".") {
+      // Every form of an application extension carries a token for its
+      // bundle: its path is resolved once per record, not once per form.
+      std::optional<std::string> canonical;
+      {
+        std::lock_guard lock(namesMutex_);
+        canonical = canonicalBundlePath_;
+      }
+      if (!canonical && (canonical = platform::canonicalPath(target.path()))) {
+        std::lock_guard lock(namesMutex_);
+        canonicalBundlePath_ = canonical;
+      }
+      if (canonical) token = platform::sandbox_extension_issue_canonical_file(*canonical);
+    } else {
+      token = model::issue_read_extension(target);
+    }
+    if (token) {
       tokens = tokens.setting(*name, lmo::Value(*token));
     } else {
       base::vtlog("failed to make extension for %@ in plug-in at %@: %s", target.path(),

@@ -215,6 +215,9 @@ class VTDPlugIn : public model::VTPlugInCore {
   mutable std::optional<std::string> localizedName_;
   mutable std::optional<std::string> localizedShortName_;
   mutable std::optional<std::string> localizedContainingName_;
+  // The bundle's canonical path, resolved for its first token and kept: a
+  // changed bundle is a new record. Guarded by namesMutex_.
+  mutable std::optional<std::string> canonicalBundlePath_;
 };
 
 using VTDPlugInPtr = std::shared_ptr<VTDPlugIn>;

@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 
 #include <limits>
+#include <optional>
+#include <thread>
 
 #include "platform/Preferences.h"
 #include "tests/platform/Helpers.h"
@@ -48,6 +50,24 @@ TEST(DeviceRestrictions, OnlyANumberRestrictsAndEveryReadSeesTheLatestWrite) {
   ASSERT_TRUE(setMaximumApplicationRating(std::nullopt).has_value());
   writer.synchronize();
   EXPECT_TRUE(writer.valueForKey(kMaxApplicationRatingKey).isNull());
+
+  // One request is one check: inside a scope the first answer stands, on
+  // this thread only, until the outermost scope ends.
+  ASSERT_TRUE(writer.setValue(kMaxApplicationRatingKey, Value::integer(4)).has_value());
+  {
+    DeviceRestrictionsReadOnce once;
+    EXPECT_EQ(maximumApplicationRating(), 4);
+    ASSERT_TRUE(writer.setValue(kMaxApplicationRatingKey, Value::integer(12)).has_value());
+    {
+      DeviceRestrictionsReadOnce nested;
+      EXPECT_EQ(maximumApplicationRating(), 4);
+    }
+    EXPECT_EQ(maximumApplicationRating(), 4);
+    std::optional<int64_t> elsewhere;
+    std::thread([&] { elsewhere = maximumApplicationRating(); }).join();
+    EXPECT_EQ(elsewhere, 12);
+  }
+  EXPECT_EQ(maximumApplicationRating(), 12);
 }
 
 }  // namespace

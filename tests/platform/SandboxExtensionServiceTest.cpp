@@ -8,6 +8,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <set>
 #include <thread>
 #include <vector>
 
@@ -160,6 +161,33 @@ TEST_F(SandboxExtension, SecretIsPrivateMadeOnceAndReused) {
   EXPECT_FALSE(sandbox_extension_issue_file(file).has_value());
   EXPECT_EQ(errno, EACCES);
   EXPECT_EQ(sandbox_extension_consume(fresh), -1);
+}
+
+TEST_F(SandboxExtension, ABatchReadsTheSecretOnceAndNeverRepeatsANonce) {
+  const std::string file = dir_.write("f", "contents");
+  const std::string canonical = canonicalPath(file).value();
+  std::set<std::string> tokens;
+  {
+    SandboxTokenBatch batch;
+    // More tokens than one draw of nonces holds.
+    for (int i = 0; i < 150; ++i) {
+      tokens.insert(sandbox_extension_issue_canonical_file(canonical).value_or(""));
+    }
+    // The secret read at the batch's first token stands until it ends...
+    const std::string before = contentsOf(secretFile());
+    ::unlink(secretFile().c_str());
+    const std::string late = sandbox_extension_issue_canonical_file(canonical).value_or("");
+    EXPECT_FALSE(std::filesystem::exists(secretFile()));
+    tokens.insert(late);
+    // ...and a path that does not exist still gets no token.
+    errno = 0;
+    EXPECT_FALSE(sandbox_extension_issue_canonical_file(dir_.file("missing")).has_value());
+    EXPECT_EQ(errno, ENOENT);
+    std::ofstream(secretFile(), std::ios::binary) << before;
+    ::chmod(secretFile().c_str(), 0600);
+  }
+  EXPECT_EQ(tokens.size(), 151u) << "a nonce came twice";
+  for (const std::string& token : tokens) EXPECT_EQ(readThrough(token), "contents");
 }
 
 TEST_F(SandboxExtension, TokenForASymlinkNamesTheCanonicalTarget) {
