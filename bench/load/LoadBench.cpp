@@ -600,7 +600,9 @@ void LoadBench::measureMemory(const DaemonProcess& daemon) {
   const double resident = static_cast<double>(memory->residentKiB) / 1024;
   const double peak = static_cast<double>(memory->peakKiB) / 1024;
   row.measured = fixed(resident, 1) + " MiB / " + fixed(peak, 1) + " MiB";
-  row.met = std::max(resident, peak) <= kMemoryGoalMiB;
+  // The goal is what the daemon keeps once it serves; the peak (start-up
+  // reading every bundle) is shown beside it.
+  row.met = resident <= kMemoryGoalMiB;
   row.set("vmrss_mib", resident);
   row.set("vmhwm_mib", peak);
 }

@@ -6,6 +6,7 @@
 // (another daemon already serves the name, the registry cannot be opened).
 // Otherwise it serves until it is stopped.
 
+#include <malloc.h>
 #include <unistd.h>
 
 #include <csignal>
@@ -73,5 +74,8 @@ int main(int argc, char** argv) {
   }
   server->setVerbose(options.verbose);
   server->setCacheLimit(options.cacheLimit);
+  // Start-up has read every bundle and built the registry; what it freed
+  // goes back to the system before the daemon settles down to serve.
+  ::malloc_trim(0);
   server->run();
 }
