@@ -175,6 +175,7 @@ std::optional<base::Error> XmlPreflight::readAttributes() {
 std::optional<base::Error> XmlPreflight::valueAllowedHere(std::string_view name) const {
   if (stack_.empty()) {
     if (rootDone_) return malformed("more than one root value");
+    if (name == "key") return malformed("key outside a dictionary");
     return std::nullopt;
   }
   const Open& top = stack_.back();

@@ -174,6 +174,8 @@ TEST(PropertyList, RejectsMalformedInput) {
       {"text after root", xmlPlist("<true/>") + "junk"},
       {"key without value", xmlPlist("<dict><key>a</key></dict>")},
       {"key in array", xmlPlist("<array><key>a</key></array>")},
+      {"key as the root", xmlPlist("<key>a</key>")},
+      {"key as a bare root", "<key>a</key>"},
       {"mismatched close", xmlPlist("<array><true/></dict>")},
       {"bad integer", xmlPlist("<integer>12abc</integer>")},
       {"integer overflow", xmlPlist("<integer>18446744073709551616</integer>")},
