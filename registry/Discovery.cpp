@@ -130,14 +130,15 @@ std::optional<VTDatabase::PlugInList> VTDatabase::findPlugIns(
   }
   if (!records) return std::nullopt;
 
+  // The registry's records type the containing bundle as an application
+  // record, so the check that it is one holds by construction.
+  std::erase_if(*records, [](const omnidex::PlugInRecordPtr& record) {
+    return !record || !record->bundlePath ||
+           (record->containingApplication && record->containingApplication->placeholder);
+  });
   PlugInList result;
   std::unordered_set<base::Uuid> seen;
-  for (const omnidex::PlugInRecordPtr& record : *records) {
-    if (!record || !record->bundlePath) continue;
-    // The registry's records type the containing bundle as an application
-    // record, so the check that it is one holds by construction.
-    if (record->containingApplication && record->containingApplication->placeholder) continue;
-    VTDPlugInPtr plugIn = plugInForProxy(record);
+  for (VTDPlugInPtr& plugIn : plugInsForProxies(*records)) {
     if (plugIn && seen.insert(*plugIn->uuid()).second) result.push_back(std::move(plugIn));
   }
   return result;

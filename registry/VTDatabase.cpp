@@ -44,6 +44,19 @@ VTDPlugInPtr VTDatabase::plugInForProxy(const omnidex::PlugInRecordPtr& record) 
   return plugIn;
 }
 
+std::vector<VTDPlugInPtr> VTDatabase::plugInsForProxies(
+    const std::vector<omnidex::PlugInRecordPtr>& records) {
+  std::vector<VTDPlugInPtr> plugIns(records.size());
+  sync_.sync([&] {
+    for (size_t i = 0; i < records.size(); ++i) {
+      if (!records[i]) continue;
+      plugIns[i] = cached(records[i]->uuid);
+      if (!plugIns[i]) plugIns[i] = createPlugInForProxy(records[i]);
+    }
+  });
+  return plugIns;
+}
+
 VTDPlugInPtr VTDatabase::createPlugInForProxy(const omnidex::PlugInRecordPtr& record) {
   sync_.assertCurrent();
   VTDPlugInPtr plugIn = VTDPlugIn::initWithOXData(record);

@@ -82,6 +82,9 @@ class VTDatabase : public omnidex::WorkspaceObserver,
 
   // The record of a registry record, from the cache or built now.
   VTDPlugInPtr plugInForProxy(const omnidex::PlugInRecordPtr& record);
+  // plugInForProxy for each record, in one turn on the database queue; the
+  // result is aligned with records (null where no record can be made).
+  std::vector<VTDPlugInPtr> plugInsForProxies(const std::vector<omnidex::PlugInRecordPtr>& records);
   // Builds, auto-elects and caches the record of a registry record (purging
   // first when the cache is over its limit). Null, with the cache unchanged,
   // when no record can be made. On the database queue only.
