@@ -51,8 +51,8 @@ base::Result<std::string> Containers::ensure(const base::Uuid& uuid) const {
   return path;
 }
 
-std::unordered_set<std::string> Containers::existing() const {
-  std::unordered_set<std::string> names;
+std::unordered_set<base::Uuid> Containers::existing() const {
+  std::unordered_set<base::Uuid> names;
   DIR* dir = ::opendir(root_.c_str());
   if (dir == nullptr) return names;
   while (const dirent* entry = ::readdir(dir)) {
@@ -64,7 +64,10 @@ std::unordered_set<std::string> Containers::existing() const {
       directory = ::fstatat(::dirfd(dir), entry->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0 &&
                   S_ISDIR(st.st_mode);
     }
-    if (directory) names.emplace(name);
+    // A container's name is its UUID's canonical text; anything else is no
+    // container of ours.
+    const std::optional<base::Uuid> uuid = base::Uuid::parse(name);
+    if (directory && uuid && uuid->string() == name) names.insert(*uuid);
   }
   ::closedir(dir);
   return names;

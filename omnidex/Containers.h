@@ -27,11 +27,11 @@ class Containers {
   // followed. Errors: domain "POSIX".
   base::Result<std::string> ensure(const base::Uuid& uuid) const;
 
-  // The names of the directories in root now (the containers that exist),
+  // The UUIDs of the directories in root now (the containers that exist),
   // read in one pass; empty when root cannot be read. Loading the registry
   // takes a container named here as it is, instead of checking each one
   // with four system calls.
-  std::unordered_set<std::string> existing() const;
+  std::unordered_set<base::Uuid> existing() const;
 
   // Removes the container of uuid with everything in it; a missing container
   // is no error. Symbolic links inside are removed, not followed.

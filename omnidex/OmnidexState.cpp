@@ -44,7 +44,7 @@ Omnidex::State::State(std::vector<ScanRoot> scanRoots, std::unique_ptr<Store> op
 base::Result<void> Omnidex::State::load() {
   std::lock_guard write(writeMutex);
   std::unique_lock index(indexMutex);
-  const std::unordered_set<std::string> existingContainers = containers.existing();
+  const std::unordered_set<base::Uuid> existingContainers = containers.existing();
   return store->load(
       [&](PlugInRow&& row) { loadPlugIn(std::move(row), existingContainers); },
       [this](ApplicationRow&& row) { loadApplication(std::move(row)); },
@@ -63,7 +63,7 @@ void Omnidex::State::loadApplication(ApplicationRow&& row) {
 }
 
 void Omnidex::State::loadPlugIn(PlugInRow&& row,
-                                const std::unordered_set<std::string>& existingContainers) {
+                                const std::unordered_set<base::Uuid>& existingContainers) {
   if (indexes.size() >= kMaxRegisteredPlugIns) {
     logUnreadableRow(row.path,
                      base::format("the registry holds %u plug-ins already", kMaxRegisteredPlugIns));
@@ -90,7 +90,7 @@ void Omnidex::State::loadPlugIn(PlugInRow&& row,
   }
   const PlugInIdentity identity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}};
   // Containers are made at registration; one removed since is made again.
-  std::optional<std::string> container = existingContainers.contains(row.uuid.string())
+  std::optional<std::string> container = existingContainers.contains(row.uuid)
                                              ? containers.pathFor(row.uuid)
                                              : containerOrLog(containers, row.uuid, row.path);
   PlugInRecordPtr record = makePlugInRecord(row.path, metadata.value(), entitlements.value(),

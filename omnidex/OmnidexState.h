@@ -85,7 +85,7 @@ struct Omnidex::State {
   void deliver(const std::vector<PlugInRecordPtr>& uninstalled,
                const std::vector<PlugInRecordPtr>& installed);
   const ScanRoot* rootOf(const std::string& item) const;
-  void loadPlugIn(PlugInRow&& row, const std::unordered_set<std::string>& existingContainers);
+  void loadPlugIn(PlugInRow&& row, const std::unordered_set<base::Uuid>& existingContainers);
   void loadApplication(ApplicationRow&& row);
 };
 
