@@ -99,6 +99,34 @@ TEST(SerialQueue, SyncWaitsForABusyQueue) {
   EXPECT_TRUE(sawFirstDone);
 }
 
+TEST(SerialQueue, TryRunHereRunsOnlyOnAnIdleQueueAndNeverWaits) {
+  SerialQueue q("try");
+  // Idle: the block runs now, on this thread, on the queue.
+  const std::thread::id self = std::this_thread::get_id();
+  bool ranHere = false;
+  EXPECT_TRUE(q.tryRunHere([&] { ranHere = q.isCurrent() && std::this_thread::get_id() == self; }));
+  EXPECT_TRUE(ranHere);
+
+  // Busy (a block runs) or with work waiting: refused at once, not run.
+  std::atomic<bool> release{false};
+  std::latch started(1);
+  q.async([&] {
+    started.count_down();
+    while (!release) std::this_thread::yield();
+  });
+  started.wait();
+  bool ran = false;
+  EXPECT_FALSE(q.tryRunHere([&] { ran = true; }));
+  q.async([] {});
+  release = true;
+  EXPECT_FALSE(ran);
+  // What was submitted meanwhile still runs, after the busy block.
+  std::atomic<bool> later{false};
+  q.async([&] { later = true; });
+  q.sync([] {});
+  EXPECT_TRUE(later);
+}
+
 // A block posted from another thread may be what lets the owner destroy the
 // queue; the posting thread must be done with the queue by then. (A notify
 // made after releasing the queue's lock raced the destructor; ThreadSanitizer
