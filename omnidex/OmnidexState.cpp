@@ -1,7 +1,10 @@
 #include "omnidex/OmnidexState.h"
 
+#include <functional>
 #include <set>
+#include <thread>
 #include <utility>
+#include <vector>
 
 #include "base/Log.h"
 #include "omnidex/BundlePaths.h"
@@ -30,6 +33,21 @@ std::optional<std::string> containerOrLog(const Containers& containers, const ba
   base::vtlog("cannot create the data container of plug-in at %@: %@", path,
               container.error().description());
   return std::nullopt;
+}
+
+// Runs work(i) for every i below count, the upper half on a second thread
+// when there is enough to share. work must only touch its own i.
+void inParallel(size_t count, const std::function<void(size_t)>& work) {
+  constexpr size_t kWorthASecondThread = 256;
+  const size_t half = count < kWorthASecondThread ? count : count / 2;
+  std::thread helper;
+  if (half < count) {
+    helper = std::thread([&] {
+      for (size_t i = half; i < count; ++i) work(i);
+    });
+  }
+  for (size_t i = 0; i < half; ++i) work(i);
+  if (helper.joinable()) helper.join();
 }
 
 }  // namespace
@@ -133,14 +151,25 @@ void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
       }
     }
   }
-  for (const PlugInEntry* entry : known) {
+  // Stamping every known bundle's files is most of a scan that finds little
+  // new: the stamps are taken on two threads, the decisions made in order.
+  std::vector<char> inScan(known.size());
+  for (size_t i = 0; i < known.size(); ++i) {
+    inScan[i] = found.erase(*known[i]->record->bundlePath) > 0;
+  }
+  std::vector<std::string> stamps(known.size());
+  inParallel(known.size(), [&](size_t i) {
+    if (inScan[i] || known[i]->isExplicit)
+      stamps[i] = plugInFingerprint(*known[i]->record->bundlePath);
+  });
+  for (size_t i = 0; i < known.size(); ++i) {
+    const PlugInEntry* entry = known[i];
     const std::string& path = *entry->record->bundlePath;
-    const bool inScan = found.erase(path) > 0;
     // A plug-in found by a scan goes when the scan no longer finds it; one
     // registered by path stays for as long as its bundle is readable.
-    if (!inScan && !entry->isExplicit) {
+    if (!inScan[i] && !entry->isExplicit) {
       planner.drop(*entry);
-    } else if (plugInFingerprint(path) == entry->fingerprint) {
+    } else if (stamps[i] == entry->fingerprint) {
       planner.keep(*entry);
     } else if (base::Result<PlugInBundle> bundle = readPlugInBundle(path); bundle.has_value()) {
       (void)planner.read(std::move(bundle).value(), Origin::kScan);  // cannot fail: not new
