@@ -67,9 +67,10 @@ lmo::Dictionary VTDPlugIn::issueResourceExtensions(const lmo::Value& resources) 
         std::lock_guard lock(namesMutex_);
         canonical = canonicalBundlePath_;
       }
+      if (canonical && canonical->empty()) canonical = target.path();
       if (!canonical && (canonical = platform::canonicalPath(target.path()))) {
         std::lock_guard lock(namesMutex_);
-        canonicalBundlePath_ = canonical;
+        canonicalBundlePath_ = *canonical == target.path() ? std::string() : *canonical;
       }
       if (canonical) token = platform::sandbox_extension_issue_canonical_file(*canonical);
     } else {

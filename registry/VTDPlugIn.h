@@ -215,8 +215,10 @@ class VTDPlugIn : public model::VTPlugInCore {
   mutable std::optional<std::string> localizedName_;
   mutable std::optional<std::string> localizedShortName_;
   mutable std::optional<std::string> localizedContainingName_;
-  // The bundle's canonical path, resolved for its first token and kept: a
-  // changed bundle is a new record. Guarded by namesMutex_.
+  // The bundle's canonical path, resolved for its first token and kept (a
+  // changed bundle is a new record): nullopt until then, and empty when it
+  // is the bundle's path itself, as it nearly always is, so that most
+  // records keep no second copy. Guarded by namesMutex_.
   mutable std::optional<std::string> canonicalBundlePath_;
 };
 
