@@ -31,6 +31,8 @@
 
 namespace vantrel::omnidex {
 
+struct ParsedRow;
+
 inline constexpr const char* kAnnounceQueueLabel = "omnidex.announce";
 
 struct Omnidex::State {
@@ -85,7 +87,9 @@ struct Omnidex::State {
   void deliver(const std::vector<PlugInRecordPtr>& uninstalled,
                const std::vector<PlugInRecordPtr>& installed);
   const ScanRoot* rootOf(const std::string& item) const;
-  void loadPlugIn(PlugInRow&& row, const std::unordered_set<base::Uuid>& existingContainers);
+  // row, its bytes parsed already (off the write path, in parallel).
+  void loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
+                  const std::unordered_set<base::Uuid>& existingContainers);
   void loadApplication(ApplicationRow&& row);
 };
 
