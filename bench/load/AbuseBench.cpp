@@ -35,6 +35,7 @@
 #include <vector>
 
 #include "bench/BenchTrees.h"
+#include "bench/load/Arguments.h"
 #include "bench/load/DaemonProcess.h"
 #include "bench/load/Wire.h"
 #include "bench/load/Workers.h"
@@ -74,35 +75,31 @@ struct Options {
 
 Options parseOptions(int argc, char** argv) {
   Options options;
-  for (int i = 1; i < argc; ++i) {
-    const std::string arg = argv[i];
-    if (arg == "--json") {
-      options.json = true;
-      continue;
-    }
-    if (i + 1 >= argc) usage(("missing value after " + arg).c_str());
-    const char* value = argv[++i];
-    char* end = nullptr;
-    const double number = std::strtod(value, &end);
-    const bool numeric = end != value && *end == '\0' && number >= 0;
-    if (arg == "--vantreld") {
-      options.vantreld = value;
-    } else if (!numeric) {
-      usage(("not a number: " + std::string(value)).c_str());
-    } else if (arg == "--idle") {
-      options.idle = static_cast<int>(number);
-    } else if (arg == "--stalled") {
-      options.stalled = static_cast<int>(number);
-    } else if (arg == "--pipeliners") {
-      options.pipeliners = static_cast<int>(number);
-    } else if (arg == "--requests") {
-      options.requests = std::max(1, static_cast<int>(number));
-    } else if (arg == "--linger") {
-      options.linger = number;
-    } else {
-      usage(("unknown option " + arg).c_str());
-    }
-  }
+  const std::optional<std::string> problem =
+      walkArguments(argc, argv, &options.json,
+                    [&](std::string_view name, const char* value,
+                        std::optional<double> number) -> std::optional<std::string> {
+                      if (name == "--vantreld") {
+                        options.vantreld = value;
+                        return std::nullopt;
+                      }
+                      if (!number) return "not a number: " + std::string(value);
+                      if (name == "--idle") {
+                        options.idle = static_cast<int>(*number);
+                      } else if (name == "--stalled") {
+                        options.stalled = static_cast<int>(*number);
+                      } else if (name == "--pipeliners") {
+                        options.pipeliners = static_cast<int>(*number);
+                      } else if (name == "--requests") {
+                        options.requests = std::max(1, static_cast<int>(*number));
+                      } else if (name == "--linger") {
+                        options.linger = *number;
+                      } else {
+                        return "unknown option " + std::string(name);
+                      }
+                      return std::nullopt;
+                    });
+  if (problem) usage(problem->c_str());
   return options;
 }
 

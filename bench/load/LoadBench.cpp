@@ -33,6 +33,7 @@
 #include <vector>
 
 #include "bench/BenchTrees.h"
+#include "bench/load/Arguments.h"
 #include "bench/load/DaemonProcess.h"
 #include "bench/load/Wire.h"
 #include "bench/load/Workers.h"
@@ -112,40 +113,38 @@ struct Options {
 
 Options parseOptions(int argc, char** argv) {
   Options options;
-  for (int i = 1; i < argc; ++i) {
-    const std::string arg = argv[i];
-    if (arg == "--json") {
-      options.json = true;
-      continue;
-    }
-    if (i + 1 == argc) usage();
-    const char* value = argv[++i];
-    char* end = nullptr;
-    const double number = std::strtod(value, &end);
-    const bool positive = *end == '\0' && number > 0;
-    if (arg == "--vantreld") {
-      options.vantreld = value;
-    } else if (!positive) {
-      usage();
-    } else if (arg == "--apps") {
-      options.apps = static_cast<int>(number);
-    } else if (arg == "--requests") {
-      options.requests = static_cast<uint64_t>(number);
-    } else if (arg == "--match-requests") {
-      options.matchRequests = static_cast<uint64_t>(number);
-    } else if (arg == "--seconds") {
-      options.seconds = number;
-    } else if (arg == "--rounds") {
-      options.rounds = static_cast<int>(number);
-    } else if (arg == "--starts") {
-      options.starts = static_cast<int>(number);
-    } else if (arg == "--cache") {
-      options.cacheLimit = static_cast<uint32_t>(number);
-    } else {
-      usage();
-    }
+  const std::optional<std::string> problem =
+      walkArguments(argc, argv, &options.json,
+                    [&](std::string_view name, const char* value,
+                        std::optional<double> number) -> std::optional<std::string> {
+                      if (name == "--vantreld") {
+                        options.vantreld = value;
+                        return std::nullopt;
+                      }
+                      if (!number) return "not a number";
+                      if (name == "--apps") {
+                        options.apps = static_cast<int>(*number);
+                      } else if (name == "--requests") {
+                        options.requests = static_cast<uint64_t>(*number);
+                      } else if (name == "--match-requests") {
+                        options.matchRequests = static_cast<uint64_t>(*number);
+                      } else if (name == "--seconds") {
+                        options.seconds = *number;
+                      } else if (name == "--rounds") {
+                        options.rounds = static_cast<int>(*number);
+                      } else if (name == "--starts") {
+                        options.starts = static_cast<int>(*number);
+                      } else if (name == "--cache") {
+                        options.cacheLimit = static_cast<uint32_t>(*number);  // 0: nothing cached
+                      } else {
+                        return "unknown option";
+                      }
+                      return std::nullopt;
+                    });
+  if (problem || options.apps < 1 || options.requests < 1 || options.matchRequests < 1 ||
+      options.seconds <= 0 || options.rounds < 1 || options.starts < 1) {
+    usage();
   }
-  if (options.apps < 1 || options.rounds < 1 || options.starts < 1) usage();
   return options;
 }
 
