@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <thread>
 #include <utility>
 
 #include "base/Log.h"
@@ -91,7 +92,19 @@ base::Result<std::shared_ptr<Omnidex>> Omnidex::open(const OmnidexConfig& config
   omnidex->state_->consent = std::move(consent);
   omnidex->state_->stateLock = std::move(lock);
   VT_TRY(omnidex->state_->containers.open());
-  VT_TRY(omnidex->state_->load());
+  State* state = omnidex->state_.get();
+  // Putting the watches in is mostly the kernel's path walks and does not
+  // depend on what is stored, so it runs beside the load instead of after.
+  std::optional<base::Result<std::unique_ptr<Watcher>>> watcher;
+  std::thread watching;
+  if (config.followChanges) watching = std::thread([&] { watcher = state->makeWatcher(); });
+  base::Result<void> loaded = state->load();
+  if (watching.joinable()) watching.join();
+  VT_TRY(loaded);
+  {
+    std::lock_guard monitor(state->monitorMutex);
+    state->openedWatcher = std::move(watcher);
+  }
   return omnidex;
 }
 
@@ -100,7 +113,10 @@ std::shared_ptr<Workspace> Omnidex::defaultWorkspace() {
   // whole life, and tearing it down during exit would race the threads that
   // still use it.
   static std::shared_ptr<Workspace>* const instance = [] {
-    base::Result<std::shared_ptr<Omnidex>> opened = open(OmnidexConfig::fromEnvironment());
+    // The process's registry is the daemon's, which always follows changes.
+    OmnidexConfig config = OmnidexConfig::fromEnvironment();
+    config.followChanges = true;
+    base::Result<std::shared_ptr<Omnidex>> opened = open(config);
     if (!opened.has_value()) {
       base::vtlog("unable to open the application registry: %@", opened.error());
       return new std::shared_ptr<Workspace>();
@@ -132,13 +148,15 @@ void Omnidex::startMonitoring() {
     if (state_->monitoring) return;
     state_->monitoring = true;
   }
-  // Watches go in before the first scan, so a change made while it runs is
-  // reported afterwards rather than missed.
-  State* state = state_.get();  // outlives the watcher: ~Omnidex stops it first
+  // Watches go in before the first scan (at open, when asked for), so a
+  // change made while it runs is reported afterwards rather than missed.
+  std::optional<base::Result<std::unique_ptr<Watcher>>> opened;
+  {
+    std::lock_guard lock(state_->monitorMutex);
+    opened.swap(state_->openedWatcher);
+  }
   base::Result<std::unique_ptr<Watcher>> watcher =
-      Watcher::create(state->roots, [state](const std::vector<std::string>& items, bool all) {
-        state->reconcileScope(all ? nullptr : &items);
-      });
+      opened ? std::move(*opened) : state_->makeWatcher();
   if (!watcher.has_value()) {
     base::vtlog("cannot follow the file system: %@", watcher.error().description());
   }

@@ -24,6 +24,9 @@ struct OmnidexConfig {
   std::string stateDirectory;                       // holds registry.sqlite3 and containers/
   std::vector<std::string> applicationDirectories;  // hold *.app bundles
   std::vector<std::string> plugInDirectories;       // hold stand-alone plug-in bundles
+  // Set when startMonitoring() will follow: the watches then go in on a
+  // second thread while the stored registry loads, rather than after it.
+  bool followChanges = false;
 
   // VANTREL_STATE_DIR (platform::stateDirectory()), VANTREL_APP_DIRS
   // (default "/Applications:<system>/Applications") and VANTREL_PLUGIN_DIRS

@@ -156,6 +156,13 @@ void Omnidex::State::loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
       PlugInEntry{std::move(record), row.isExplicit, std::move(row.fingerprint), parsed.digest});
 }
 
+base::Result<std::unique_ptr<Watcher>> Omnidex::State::makeWatcher() {
+  // The state outlives the watcher: ~Omnidex stops it first.
+  return Watcher::create(roots, [this](const std::vector<std::string>& items, bool all) {
+    reconcileScope(all ? nullptr : &items);
+  });
+}
+
 const ScanRoot* Omnidex::State::rootOf(const std::string& item) const {
   const size_t slash = item.rfind('/');
   const std::string parent = slash == 0 ? "/" : item.substr(0, slash);

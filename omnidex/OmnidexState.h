@@ -13,6 +13,7 @@
 
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <shared_mutex>
 #include <string>
 #include <unordered_set>
@@ -77,6 +78,11 @@ struct Omnidex::State {
   std::mutex monitorMutex;
   bool monitoring = false;           // Guarded by monitorMutex.
   std::unique_ptr<Watcher> watcher;  // Guarded by monitorMutex.
+  // Watches put in at open, for startMonitoring() to take.
+  std::optional<base::Result<std::unique_ptr<Watcher>>> openedWatcher;  // Guarded by monitorMutex.
+
+  // A watcher of the roots whose changes are reconciled here; not started.
+  base::Result<std::unique_ptr<Watcher>> makeWatcher();
 
   // Delivers announcements one at a time, in the order they were posted.
   // ~Omnidex destroys it (so drains it) before anything else goes.

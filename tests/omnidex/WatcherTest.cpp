@@ -51,9 +51,19 @@ bool eventually(Predicate predicate, std::chrono::milliseconds timeout = kAnnoun
   return true;
 }
 
-TEST(OmnidexWatcher, ApplicationsCopiedInAndDeletedAreAnnounced) {
+// Watches put in by startMonitoring(), or at open beside the load.
+class OmnidexWatcherOpened : public ::testing::TestWithParam<bool> {};
+
+INSTANTIATE_TEST_SUITE_P(WatchesFrom, OmnidexWatcherOpened, ::testing::Bool(),
+                         [](const auto& param) {
+                           return param.param ? "Open" : "StartMonitoring";
+                         });
+
+TEST_P(OmnidexWatcherOpened, ApplicationsCopiedInAndDeletedAreAnnounced) {
   RegistryTree tree;
-  auto registry = tree.open();
+  OmnidexConfig config = tree.config();
+  config.followChanges = GetParam();
+  auto registry = Omnidex::open(config).value();
   auto observer = observe(*registry);
   registry->startMonitoring();
 
