@@ -110,9 +110,11 @@ void Transaction::dispatch() {
       if (operation.scope == Scope::kChangesState && !allowStateChange(*type)) return;
       // Rules are matched against every candidate: one request logs an
       // unknown operator once, not once per candidate and element. Likewise
-      // it reads the device's restrictions and the token secret once.
+      // it reads the device's restrictions, the token secret and whether
+      // its client still runs the executable it connected with once.
       registry::MatchLogOnce logOnce;
       platform::DeviceRestrictionsReadOnce restrictionsOnce;
+      VTDLmoClient::ExecutableReadOnce executableOnce;
       platform::SandboxTokenBatch tokens;
       (this->*operation.run)();
       return;

@@ -105,7 +105,40 @@ void VTDLmoClient::dead() {
   probes::clientDone(pid_);
 }
 
+namespace {
+
+// This thread's VTDLmoClient::ExecutableReadOnce: whether one is open, and
+// the client whose answer it holds.
+struct ExecutableRead {
+  bool active = false;
+  const VTDLmoClient* client = nullptr;
+  bool runs = false;
+};
+thread_local ExecutableRead tlsExecutableRead;
+
+}  // namespace
+
+VTDLmoClient::ExecutableReadOnce::ExecutableReadOnce() : outermost_(!tlsExecutableRead.active) {
+  if (outermost_) tlsExecutableRead.active = true;
+}
+
+VTDLmoClient::ExecutableReadOnce::~ExecutableReadOnce() {
+  if (outermost_) tlsExecutableRead = ExecutableRead{};
+}
+
 bool VTDLmoClient::runsIdentifiedExecutable() const {
+  ExecutableRead& once = tlsExecutableRead;
+  if (once.active && once.client == this) return once.runs;
+  const bool runs = readRunsIdentifiedExecutable();
+  // A request has one client; another checked inside it is read each time.
+  if (once.active && once.client == nullptr) {
+    once.client = this;
+    once.runs = runs;
+  }
+  return runs;
+}
+
+bool VTDLmoClient::readRunsIdentifiedExecutable() const {
   if (!executable_) return true;  // never read: the task could not be made either
   const std::optional<platform::FileIdentity> now = platform::processExecutableIdentity(pid_);
   // Gone, or a zombie: it runs nothing else, and what it was identified

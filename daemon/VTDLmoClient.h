@@ -62,6 +62,21 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
   // The entitlement exists and is not false.
   bool hasEntitlement(std::string_view key) const override;
 
+  // While one is open on a thread, whether a client still runs the
+  // executable it connected with is read once there, by the first lookup of
+  // its entitlements: a request is one check, not one per plug-in it is
+  // checked against. Nests: the outermost one ends the reading.
+  class ExecutableReadOnce {
+   public:
+    ExecutableReadOnce();
+    ~ExecutableReadOnce();
+    ExecutableReadOnce(const ExecutableReadOnce&) = delete;
+    ExecutableReadOnce& operator=(const ExecutableReadOnce&) = delete;
+
+   private:
+    const bool outermost_;
+  };
+
   // "<VTDLmoClient %p pid=%d con=%@>", or "<VTDLmoClient %p NO CONNECTION>"
   // once the connection is gone.
   std::string description() const;
@@ -92,8 +107,10 @@ class VTDLmoClient : public registry::VTDHost, public std::enable_shared_from_th
  private:
   VTDLmoClient() = default;
   void identifyPeer(const lmo::Connection& connection);
-  // Whether the peer still runs the executable it was identified with.
+  // Whether the peer still runs the executable it was identified with;
+  // read once per ExecutableReadOnce.
   bool runsIdentifiedExecutable() const;
+  bool readRunsIdentifiedExecutable() const;
   void handleEvent(const lmo::Event& event);
   void handleMessage(const lmo::IncomingMessage& message);
   // Counts the request and reports every kRequestCountReportInterval-th.
