@@ -74,7 +74,7 @@ void VTDLmoClient::handleMessage(const lmo::IncomingMessage& message) {
   probes::requestInput(pid_, [&] { return lmo::describe(message.body()); });
   std::shared_ptr<Transaction> transaction =
       Transaction::initWithRequest(message, shared_from_this());
-  server_->submitWork([transaction] {
+  server_->submitRequest([transaction] {
     base::LogBudgetScope charged(transaction->client()->logBudget());
     transaction->client()->countRequest();
     transaction->dispatch();

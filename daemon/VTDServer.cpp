@@ -98,6 +98,15 @@ void VTDServer::submitWork(std::function<void()> work) {
   mainQueue_->async(std::move(work));
 }
 
+void VTDServer::submitRequest(std::function<void()> work) {
+  // Handing a request to the queue's worker costs a wake-up and a context
+  // switch, about as much as the whole round trip of a raw socket: when
+  // nothing is queued, the delivering thread runs it instead, holding the
+  // queue as the worker would. Queued work keeps its turn.
+  if (mainQueue_->tryRunHere(work)) return;
+  mainQueue_->async(std::move(work));
+}
+
 void VTDServer::removedPlugIns(const std::vector<omnidex::PlugInRecordPtr>& records) {
   for (const omnidex::PlugInRecordPtr& record : records) {
     const std::optional<std::string> bundleIdentifier = record->bundleIdentifier;

@@ -6,7 +6,11 @@
 // Queues:
 //   "lmo"        new connections and every client connection's events; only
 //                client objects and transactions are made there.
-//   "service"    every transaction, one at a time (submitWork).
+//   "service"    every transaction, one at a time (submitRequest,
+//                submitWork). A request may run on the thread that
+//                delivered it (the I/O thread, or the "lmo" queue's) when
+//                the queue is idle, so work on it must never wait for the
+//                I/O thread or the "lmo" queue.
 //   "serverSync" the list of holds; entered synchronously from the service
 //                queue and from connection events, never from itself.
 // The database queue ("VTDatabase", inherited) is entered from the service
@@ -93,6 +97,10 @@ class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelega
 
   // Runs work on the service queue, after the work submitted before it.
   void submitWork(std::function<void()> work);
+  // The same for a request's work, from the connection's event handler:
+  // run on the calling thread when the queue is idle. The caller must hold
+  // no lock the work could need.
+  void submitRequest(std::function<void()> work);
 
   // ---- Holds (each synchronous; never call them on syncQueue()) ----
 

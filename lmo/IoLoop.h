@@ -1,7 +1,9 @@
 #pragma once
 // The process's one I/O thread: an epoll loop that watches every listener and
-// connection socket and runs their I/O callbacks. Callbacks only move bytes
-// and hand events to serial queues; handler code never runs here.
+// connection socket and runs their I/O callbacks. Callbacks move bytes and
+// hand events to serial queues; handler code runs here only by borrowing an
+// idle queue (SerialQueue::tryRunHere), so nothing that can run on such a
+// queue may wait for this thread (runAndWait is for set-up and tear-down).
 
 #include <sys/epoll.h>
 

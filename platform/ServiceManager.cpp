@@ -165,8 +165,12 @@ class ServiceManager::HostWatcher {
   HostWatcher(const HostWatcher&) = delete;
   HostWatcher& operator=(const HostWatcher&) = delete;
 
+  // watch and unwatch are posted, not waited for: the manager's queue must
+  // never wait for the I/O thread, which may be running a request that is
+  // waiting for that queue. Posts run in order, so an unwatch follows its
+  // watch, and stop() (which waits) follows both.
   void watch(HostPtr host) {
-    onLoop([this, host = std::move(host)] {
+    lmo::IoLoop::shared().post([this, host = std::move(host)] {
       if (stopping_ || sources_.contains(host.get())) return;
       auto source = std::make_shared<Source>(this, host);
       source->token = lmo::IoLoop::shared().add(host->pidfd, EPOLLIN, source);
@@ -175,12 +179,13 @@ class ServiceManager::HostWatcher {
   }
 
   void unwatch(const HostPtr& host) {
-    onLoop([this, host] { forget(host.get()); });
+    lmo::IoLoop::shared().post([this, host] { forget(host.get()); });
   }
 
-  // Stops watching every host; no exit is reported afterwards.
+  // Stops watching every host; no exit is reported afterwards. Waits, so
+  // only at the manager's end.
   void stop() {
-    onLoop([this] {
+    lmo::IoLoop::shared().runAndWait([this] {
       stopping_ = true;
       while (!sources_.empty()) forget(sources_.begin()->first);
     });
@@ -194,8 +199,6 @@ class ServiceManager::HostWatcher {
     const HostPtr host;
     uint64_t token = 0;
   };
-
-  static void onLoop(const std::function<void()>& task) { lmo::IoLoop::shared().runAndWait(task); }
 
   // On the I/O thread.
   void forget(const Host* host) {

@@ -18,6 +18,7 @@
 
 #include "base/Log.h"
 #include "base/SerialQueue.h"
+#include "lmo/IoLoop.h"
 #include "platform/AtomicFile.h"
 #include "platform/PropertyList.h"
 #include "tests/platform/Helpers.h"
@@ -251,6 +252,25 @@ TEST(ServiceManager, AHostsExitRemovesItsRegistrationsAndFiles) {
   EXPECT_FALSE(f.hasLaunchDirectory(leaving.pid));
   EXPECT_TRUE(fs::exists(f.launchFile(staying, "a")));
   EXPECT_EQ(servicesOnDisk(manager), 1u);
+}
+
+TEST(ServiceManager, RegisteringAndRemovingNeverWaitForTheIoThread) {
+  // The daemon may run a request on the I/O thread; a request that
+  // registers a service then waits for the manager's queue, which must not
+  // be waiting for the I/O thread in turn.
+  Fixture f;
+  HostProcess host;
+  ServiceManager manager(f.dir.path().string());
+  std::promise<void> release;
+  lmo::IoLoop::shared().post([held = release.get_future().share()] { held.wait(); });
+  std::future<bool> changed = std::async(std::launch::async, [&] {
+    return f.add(manager, "a", "1", host) && remove(manager, "a", "1") == 0;
+  });
+  const bool finished = changed.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
+  release.set_value();
+  ASSERT_TRUE(finished) << "the service manager waited for the I/O thread";
+  EXPECT_TRUE(changed.get());
+  EXPECT_FALSE(f.hasLaunchDirectory(host.pid));
 }
 
 TEST(ServiceManager, TheTableOutlivesTheInstanceButNotItsHosts) {
