@@ -93,7 +93,11 @@ std::vector<PlugInRecordPtr> Indexes::candidates(const lmo::Dictionary& query) c
 
 void Indexes::indexUnder(KeyIndex& index, const std::vector<std::string>& keys,
                          const PlugInRecordPtr& record) {
-  for (const std::string& key : keys) index[key][*record->bundlePath] = record;
+  // The end is the hint: loading the store puts records in path order.
+  for (const std::string& key : keys) {
+    std::map<std::string, PlugInRecordPtr>& paths = index[key];
+    paths.insert_or_assign(paths.end(), *record->bundlePath, record);
+  }
 }
 
 void Indexes::unindexUnder(KeyIndex& index, const std::vector<std::string>& keys,
@@ -107,12 +111,16 @@ void Indexes::unindexUnder(KeyIndex& index, const std::vector<std::string>& keys
 }
 
 void Indexes::put(PlugInEntry entry) {
-  const std::string path = *entry.record->bundlePath;
-  erase(path);
-  indexUnder(byExtensionPoint_, extensionPointKeys(*entry.record), entry.record);
-  indexUnder(byIdentifier_, identifierKeys(*entry.record), entry.record);
-  byUuid_[entry.record->uuid] = entry.record;
-  byPath_.emplace(path, std::move(entry));
+  const PlugInRecordPtr record = entry.record;
+  const std::string& path = *record->bundlePath;
+  // Loading the store puts entries in path order: past the last path there
+  // is nothing to replace, and the entry goes at the end without a search.
+  const bool last = byPath_.empty() || byPath_.rbegin()->first < path;
+  if (!last) erase(path);
+  indexUnder(byExtensionPoint_, extensionPointKeys(*record), record);
+  indexUnder(byIdentifier_, identifierKeys(*record), record);
+  byUuid_[record->uuid] = record;
+  byPath_.emplace_hint(byPath_.end(), path, std::move(entry));
 }
 
 void Indexes::erase(const std::string& path) {

@@ -65,6 +65,9 @@ struct ParsedRow {
   base::Result<PlugInInfo> metadata;
   base::Result<lmo::Dictionary> entitlements;
   ContentDigest digest;
+  // Made beside the parse when the row's application is loaded and its
+  // container exists; otherwise made (and they) when the row is loaded.
+  PlugInRecordPtr record;
 };
 
 namespace {
@@ -88,9 +91,10 @@ base::Result<void> Omnidex::State::load() {
     parsed.assign(chunk.size(), std::nullopt);
     inParallel(chunk.size(), [&](size_t i) {
       const PlugInRow& row = chunk[i];
-      parsed[i].emplace(ParsedRow{parsePlugInInfo(row.path, row.infoBytes),
-                                  parseEntitlements(row.entitlementsBytes),
-                                  contentDigest(row.infoBytes, row.entitlementsBytes)});
+      ParsedRow& p = parsed[i].emplace(ParsedRow{
+          parsePlugInInfo(row.path, row.infoBytes), parseEntitlements(row.entitlementsBytes),
+          contentDigest(row.infoBytes, row.entitlementsBytes), nullptr});
+      p.record = recordIfReady(row, p, existingContainers);
     });
     for (size_t i = 0; i < chunk.size(); ++i) {
       loadPlugIn(std::move(chunk[i]), std::move(*parsed[i]), existingContainers);
@@ -119,11 +123,35 @@ void Omnidex::State::loadApplication(ApplicationRow&& row) {
       ApplicationEntry{makeApplicationRecord(row.path, info), std::move(row.fingerprint), digest});
 }
 
+PlugInRecordPtr Omnidex::State::recordIfReady(
+    const PlugInRow& row, const ParsedRow& parsed,
+    const std::unordered_set<base::Uuid>& existingContainers) const {
+  if (!parsed.metadata.has_value() || !parsed.entitlements.has_value() ||
+      !existingContainers.contains(row.uuid)) {
+    return nullptr;
+  }
+  ApplicationRecordPtr app;
+  if (std::optional<std::string> appPath = containingApplicationPath(row.path)) {
+    const ApplicationEntry* entry = indexes.applicationAt(*appPath);
+    if (entry == nullptr) return nullptr;
+    app = entry->record;
+  }
+  return makePlugInRecord(
+      row.path, parsed.metadata.value(), parsed.entitlements.value(),
+      PlugInIdentity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}}, std::move(app),
+      containers.pathFor(row.uuid));
+}
+
 void Omnidex::State::loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
                                 const std::unordered_set<base::Uuid>& existingContainers) {
   if (indexes.size() >= kMaxRegisteredPlugIns) {
     logUnreadableRow(row.path,
                      base::format("the registry holds %u plug-ins already", kMaxRegisteredPlugIns));
+    return;
+  }
+  if (parsed.record) {
+    indexes.put(PlugInEntry{std::move(parsed.record), row.isExplicit, std::move(row.fingerprint),
+                            parsed.digest});
     return;
   }
   const base::Result<PlugInInfo>& metadata = parsed.metadata;

@@ -93,6 +93,11 @@ struct Omnidex::State {
   void deliver(const std::vector<PlugInRecordPtr>& uninstalled,
                const std::vector<PlugInRecordPtr>& installed);
   const ScanRoot* rootOf(const std::string& item) const;
+  // row's record when it can be made without changing anything (its
+  // application loaded, its container there); reads indexes, so it runs
+  // while nothing writes them.
+  PlugInRecordPtr recordIfReady(const PlugInRow& row, const ParsedRow& parsed,
+                                const std::unordered_set<base::Uuid>& existingContainers) const;
   // row, its bytes parsed already (off the write path, in parallel).
   void loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
                   const std::unordered_set<base::Uuid>& existingContainers);

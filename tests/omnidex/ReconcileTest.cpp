@@ -210,5 +210,24 @@ TEST(OmnidexReconcile, AnUnreadableRowIsSkippedAndTheRestLoads) {
   EXPECT_NE(tree.open()->plugInForUrl(bad), nullptr);
 }
 
+TEST(OmnidexReconcile, PlugInsWhoseApplicationRowIsGoneShareTheApplicationReadAgain) {
+  RegistryTree tree;
+  const std::string app = tree.apps() + "/Notes.app";
+  writeBundle(app, Dictionary{{"KBBundleName", "Notes"}});
+  const std::string share = writeBundle(app + "/PlugIns/Share.appex", plugInInfo("n.share", "p"));
+  const std::string widget = writeBundle(app + "/PlugIns/Widget.appex", plugInInfo("n.w", "p"));
+  tree.open()->reconcile();
+  runSql(tree.state() + "/registry.sqlite3", "DELETE FROM applications");
+
+  auto registry = tree.open();
+  const PlugInRecordPtr first = registry->plugInForUrl(share);
+  const PlugInRecordPtr second = registry->plugInForUrl(widget);
+  ASSERT_TRUE(first && second && first->containingApplication);
+  EXPECT_FALSE(first->containingApplication->placeholder);
+  EXPECT_EQ(first->containingApplication->localizedName, "Notes");
+  EXPECT_EQ(second->containingApplication, first->containingApplication);
+  EXPECT_EQ(registry->applicationForUrl(app).application, first->containingApplication);
+}
+
 }  // namespace
 }  // namespace vantrel::omnidex
