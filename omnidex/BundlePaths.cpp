@@ -21,9 +21,15 @@ std::optional<std::string> normalizeBundlePath(std::string_view path) {
 }
 
 std::optional<std::string> containingApplicationPath(const std::string& bundlePath) {
+  std::optional<std::string_view> app = containingApplicationPathView(bundlePath);
+  if (!app) return std::nullopt;
+  return std::string(*app);
+}
+
+std::optional<std::string_view> containingApplicationPathView(std::string_view bundlePath) {
   const size_t slash = bundlePath.rfind('/');
   if (slash == std::string::npos || slash == 0) return std::nullopt;
-  const std::string_view parent = std::string_view(bundlePath).substr(0, slash);
+  const std::string_view parent = bundlePath.substr(0, slash);
   const size_t parentSlash = parent.rfind('/');
   if (parentSlash == std::string_view::npos) return std::nullopt;
   if (parent.substr(parentSlash + 1) != kPlugInsDirectoryName) return std::nullopt;
@@ -35,7 +41,7 @@ std::optional<std::string> containingApplicationPath(const std::string& bundlePa
   if (appName.size() <= kApplicationExtension.size() || !appName.ends_with(kApplicationExtension)) {
     return std::nullopt;
   }
-  return std::string(app);
+  return app;
 }
 
 std::string bundleStem(const std::string& bundlePath) {

@@ -21,6 +21,8 @@ std::optional<std::string> normalizeBundlePath(std::string_view path);
 // bundle lies directly in "<X>.app/PlugIns/", else nullopt. bundlePath must
 // be normal (normalizeBundlePath).
 std::optional<std::string> containingApplicationPath(const std::string& bundlePath);
+// The same, as a view into bundlePath (for loops over many bundles).
+std::optional<std::string_view> containingApplicationPathView(std::string_view bundlePath);
 
 // The bundle directory's name without its extension ("Notes" for
 // "/Applications/Notes.app").

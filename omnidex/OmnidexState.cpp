@@ -1,6 +1,8 @@
 #include "omnidex/OmnidexState.h"
 
+#include <algorithm>
 #include <functional>
+#include <iterator>
 #include <optional>
 #include <set>
 #include <thread>
@@ -203,15 +205,17 @@ const ScanRoot* Omnidex::State::rootOf(const std::string& item) const {
 void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
   std::lock_guard write(writeMutex);
   Planner planner(indexes, containers, currentDate());
-  // The plug-in bundles found in the scanned scope, and the registered
-  // plug-ins in it.
-  std::set<std::string> found;
+  // The plug-in bundles found in the scanned scope (sorted once all are
+  // in), and the registered plug-ins in it.
+  std::vector<std::string> found;
+  const auto addFound = [&found](std::vector<std::string> bundles) {
+    found.insert(found.end(), std::make_move_iterator(bundles.begin()),
+                 std::make_move_iterator(bundles.end()));
+  };
   std::vector<const PlugInEntry*> known;
   if (items == nullptr) {
     for (const ScanRoot& root : roots) {
-      for (const std::string& item : itemsOf(root)) {
-        for (std::string& bundle : bundlesOfItem(root.kind, item)) found.insert(std::move(bundle));
-      }
+      for (const std::string& item : itemsOf(root)) addFound(bundlesOfItem(root.kind, item));
     }
     for (const auto& [path, entry] : indexes.plugIns()) known.push_back(&entry);
   } else {
@@ -219,7 +223,7 @@ void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
     for (const std::string& item : *items) {
       const ScanRoot* root = rootOf(item);
       if (root == nullptr) continue;
-      for (std::string& bundle : bundlesOfItem(root->kind, item)) found.insert(std::move(bundle));
+      addFound(bundlesOfItem(root->kind, item));
       for (const PlugInEntry* entry : indexes.plugInsWithin(item)) {
         if (seen.insert(*entry->record->bundlePath).second) known.push_back(entry);
       }
@@ -227,9 +231,15 @@ void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
   }
   // Stamping every known bundle's files is most of a scan that finds little
   // new: the stamps are taken on two threads, the decisions made in order.
+  std::sort(found.begin(), found.end());
+  found.erase(std::unique(found.begin(), found.end()), found.end());
   std::vector<char> inScan(known.size());
+  std::vector<char> isKnown(found.size());
   for (size_t i = 0; i < known.size(); ++i) {
-    inScan[i] = found.erase(*known[i]->record->bundlePath) > 0;
+    const std::string& path = *known[i]->record->bundlePath;
+    const auto it = std::lower_bound(found.begin(), found.end(), path);
+    inScan[i] = it != found.end() && *it == path;
+    if (inScan[i]) isKnown[static_cast<size_t>(it - found.begin())] = 1;
   }
   std::vector<std::string> stamps(known.size());
   inParallel(known.size(), [&](size_t i) {
@@ -252,8 +262,9 @@ void Omnidex::State::reconcileScope(const std::vector<std::string>* items) {
       planner.drop(*entry);
     }
   }
-  for (const std::string& path : found) {
-    base::Result<PlugInBundle> bundle = readPlugInBundle(path);
+  for (size_t j = 0; j < found.size(); ++j) {
+    if (isKnown[j]) continue;
+    base::Result<PlugInBundle> bundle = readPlugInBundle(found[j]);
     if (!bundle.has_value()) {
       logRefusedBundle(bundle.error());
       continue;

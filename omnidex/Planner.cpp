@@ -56,7 +56,8 @@ void Planner::drop(const PlugInEntry& entry) {
 }
 
 void Planner::keep(const PlugInEntry& entry) {
-  decisions_.insert_or_assign(*entry.record->bundlePath,
+  // A scan keeps bundles in path order: the end is the hint.
+  decisions_.insert_or_assign(decisions_.end(), *entry.record->bundlePath,
                               Decision{Kind::kKeep, &entry, std::nullopt, entry.isExplicit});
 }
 
@@ -99,7 +100,7 @@ void Planner::resolveApplication(const std::string& appPath, bool keptByThisChan
 }
 
 ApplicationRecordPtr Planner::applicationFor(const std::string& path) const {
-  std::optional<std::string> appPath = containingApplicationPath(path);
+  std::optional<std::string_view> appPath = containingApplicationPathView(path);
   if (!appPath) return nullptr;
   auto it = applications_.find(*appPath);
   return it == applications_.end() ? nullptr : it->second;
@@ -216,10 +217,12 @@ void Planner::plan(const std::string& path, Decision& decision, ChangeSet& chang
 ChangeSet Planner::finish() {
   ChangeSet changes;
   // Application path -> whether a plug-in of this change stays in it.
-  std::map<std::string, bool> appPaths;
+  std::map<std::string, bool, std::less<>> appPaths;
   for (const auto& [path, decision] : decisions_) {
-    if (std::optional<std::string> app = containingApplicationPath(path)) {
-      appPaths[*app] |= decision.kind != Kind::kDrop;
+    if (std::optional<std::string_view> app = containingApplicationPathView(path)) {
+      auto it = appPaths.lower_bound(*app);
+      if (it == appPaths.end() || it->first != *app) it = appPaths.emplace_hint(it, *app, false);
+      it->second |= decision.kind != Kind::kDrop;
     }
   }
   for (const auto& [appPath, kept] : appPaths) resolveApplication(appPath, kept, changes);
@@ -229,7 +232,7 @@ ChangeSet Planner::finish() {
     const std::string& appPath = app.first;
     for (const PlugInEntry* entry : indexes_.plugInsWithin(appPath)) {
       const std::string& path = *entry->record->bundlePath;
-      if (!decisions_.contains(path) && containingApplicationPath(path) == appPath) {
+      if (!decisions_.contains(path) && containingApplicationPathView(path) == appPath) {
         rehome(*entry, changes);
       }
     }

@@ -95,7 +95,7 @@ class Planner {
   std::map<std::string, Decision> decisions_;  // by bundle path
   // The application records this change settles on, by application path;
   // null for an application that is dropped.
-  std::map<std::string, ApplicationRecordPtr> applications_;
+  std::map<std::string, ApplicationRecordPtr, std::less<>> applications_;
 };
 
 }  // namespace vantrel::omnidex
