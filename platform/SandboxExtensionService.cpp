@@ -210,6 +210,7 @@ struct BatchState {
   std::string secret;
   uint8_t nonces[kBatchNonces * kNonceBytes] = {};
   size_t noncesLeft = 0;
+  bool noncesDrawn = false;  // nonces has held random bytes in this batch
 };
 thread_local BatchState tlsBatch;
 
@@ -226,6 +227,7 @@ int batchedSecret(std::string* secret) {
 int batchedNonce(uint8_t* nonce) {
   if (!tlsBatch.active) return nonceBytes(nonce, kNonceBytes);
   if (tlsBatch.noncesLeft == 0) {
+    tlsBatch.noncesDrawn = true;
     if (int err = nonceBytes(tlsBatch.nonces, sizeof tlsBatch.nonces)) return err;
     tlsBatch.noncesLeft = kBatchNonces;
   }
@@ -363,9 +365,15 @@ SandboxTokenBatch::SandboxTokenBatch() : outermost_(!tlsBatch.active) {
 
 SandboxTokenBatch::~SandboxTokenBatch() {
   if (!outermost_) return;
-  OPENSSL_cleanse(tlsBatch.secret.data(), tlsBatch.secret.size());
-  OPENSSL_cleanse(tlsBatch.nonces, sizeof tlsBatch.nonces);
-  tlsBatch = BatchState{};
+  // Most requests issue no token: only what this batch read is wiped.
+  if (tlsBatch.secretRead) OPENSSL_cleanse(tlsBatch.secret.data(), tlsBatch.secret.size());
+  if (tlsBatch.noncesDrawn) OPENSSL_cleanse(tlsBatch.nonces, sizeof tlsBatch.nonces);
+  tlsBatch.active = false;
+  tlsBatch.secretRead = false;
+  tlsBatch.secretError = 0;
+  tlsBatch.secret.clear();
+  tlsBatch.noncesLeft = 0;
+  tlsBatch.noncesDrawn = false;
 }
 
 std::optional<std::string> sandbox_extension_issue_canonical_file(const std::string& canonical) {
