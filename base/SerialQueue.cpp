@@ -86,8 +86,7 @@ void SerialQueue::sync(const Block& block) {
     // Idle: run on the caller's thread, holding the queue like a lock.
     running_ = true;
     lock.unlock();
-    Task inlineTask{[&block] { block(); }, tls.held, nullptr};
-    runBlock(inlineTask);
+    runHere(block);
     lock.lock();
     running_ = false;
     if (!tasks_.empty()) wake_.notify_one();
@@ -105,8 +104,7 @@ bool SerialQueue::tryRunHere(const Block& block) {
     if (running_ || !tasks_.empty() || stopping_) return false;
     running_ = true;
   }
-  Task inlineTask{[&block] { block(); }, tls.held, nullptr};
-  runBlock(inlineTask);
+  runHere(block);
   std::lock_guard lock(mutex_);
   running_ = false;
   if (!tasks_.empty()) wake_.notify_one();
@@ -139,6 +137,18 @@ void SerialQueue::runBlock(Task& task) {
   tls.held.push_back(this);
   task.block();
   tls = std::move(saved);
+}
+
+void SerialQueue::runHere(const Block& block) {
+  // The thread keeps every queue it holds and holds this one too, as a
+  // worker running a block submitted from here would; no copies, since
+  // this is on every request's path.
+  const SerialQueue* const previous = tls.current;
+  tls.current = this;
+  tls.held.push_back(this);
+  block();
+  tls.held.pop_back();
+  tls.current = previous;
 }
 
 void SerialQueue::workerLoop() {

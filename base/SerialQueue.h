@@ -72,6 +72,8 @@ class SerialQueue {
 
   void workerLoop();
   void runBlock(Task& task);
+  // Runs block on the calling thread, which holds the queue (running_).
+  void runHere(const Block& block);
   bool isHeldByThisThread() const;
 
   const std::string label_;

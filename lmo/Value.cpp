@@ -59,6 +59,14 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries)
 
 Dictionary Dictionary::fromEntries(std::vector<Entry> entries) {
   if (entries.empty()) return Dictionary();
+  // What peers and files send is usually in key order already (our own
+  // encoders write it so): then there is nothing to sort or merge.
+  const auto outOfOrder =
+      std::adjacent_find(entries.begin(), entries.end(),
+                         [](const Entry& a, const Entry& b) { return !(a.first < b.first); });
+  if (outOfOrder == entries.end()) {
+    return Dictionary(std::make_shared<const std::vector<Entry>>(std::move(entries)));
+  }
   // Stable sort keeps the given order among equal keys, so the last of them
   // is the one to keep.
   std::stable_sort(entries.begin(), entries.end(),

@@ -82,6 +82,27 @@ TEST(Value, LooseConversionsNeverInvokeUndefinedBehaviour) {
   for (const Case& c : cases) EXPECT_EQ(c.v.boolValue(), c.want) << describe(c.v);
 }
 
+TEST(Dictionary, FromEntriesKeepsOneEntryPerKeyInKeyOrder) {
+  using Entries = std::vector<Dictionary::Entry>;
+  const struct {
+    const char* name;
+    Entries given;
+    Entries want;
+  } cases[] = {
+      {"in order", {{"a", Value("1")}, {"b", Value("2")}}, {{"a", Value("1")}, {"b", Value("2")}}},
+      {"in order with a duplicate",
+       {{"a", Value("1")}, {"b", Value("2")}, {"b", Value("3")}},
+       {{"a", Value("1")}, {"b", Value("3")}}},
+      {"out of order",
+       {{"c", Value("3")}, {"a", Value("1")}, {"c", Value("4")}},
+       {{"a", Value("1")}, {"c", Value("4")}}},
+  };
+  for (const auto& c : cases) {
+    const Dictionary d = Dictionary::fromEntries(c.given);
+    EXPECT_EQ(Entries(d.begin(), d.end()), c.want) << c.name;
+  }
+}
+
 TEST(Dictionary, ChangesReturnNewDictionariesAndLeaveTheReceiver) {
   Dictionary d{{"b", Value("2")}, {"a", Value("1")}, {"b", Value("3")}};
   EXPECT_EQ(d.size(), 2u);
