@@ -230,12 +230,6 @@ class Decoder {
     return base::Result<void>::success();
   }
 
-  base::Result<std::string> text(const Head& h) {
-    std::string s;
-    VT_TRY(stringBody(h, s));
-    return s;
-  }
-
   base::Result<Value> item(int depth) {
     Head h = VT_TRY(head());
     switch (h.major) {
@@ -248,8 +242,11 @@ class Decoder {
         VT_TRY(stringBody(h, s));
         return Value::data(s.data(), s.size());
       }
-      case kText:
-        return Value(VT_TRY(text(h)));
+      case kText: {
+        std::string s;
+        VT_TRY(stringBody(h, s));
+        return Value(std::move(s));
+      }
       case kArray:
         return array(h, depth + 1);
       case kMap:
@@ -325,14 +322,14 @@ class Decoder {
     if (depth > kMaxCborDepth) return tooDeep();
     std::vector<Dictionary::Entry> entries;
     if (h.info == kIndefinite) {
-      while (!atBreak()) entries.push_back(VT_TRY(entry(depth)));
+      while (!atBreak()) VT_TRY(appendEntry(entries, depth));
       ++p_;
     } else {
       if (h.arg > remaining() / 2) {
         return lmoErrorf(kLmoMalformed, "map of %u entries is longer than its input", h.arg);
       }
       entries.reserve(static_cast<size_t>(h.arg));
-      for (uint64_t i = 0; i < h.arg; ++i) entries.push_back(VT_TRY(entry(depth)));
+      for (uint64_t i = 0; i < h.arg; ++i) VT_TRY(appendEntry(entries, depth));
     }
     size_t count = entries.size();
     Dictionary d = Dictionary::fromEntries(std::move(entries));
@@ -342,12 +339,17 @@ class Decoder {
     return Value(std::move(d));
   }
 
-  base::Result<Dictionary::Entry> entry(int depth) {
+  // Decodes one key and value onto the end of entries, in place: a map is
+  // on every message's path.
+  base::Result<void> appendEntry(std::vector<Dictionary::Entry>& entries, int depth) {
     Head k = VT_TRY(head());
     if (k.major != kText) return lmoError(kLmoMalformed, "map key is not a text string");
-    std::string key = VT_TRY(text(k));
-    Value v = VT_TRY(item(depth));
-    return Dictionary::Entry{std::move(key), std::move(v)};
+    std::string key;
+    VT_TRY(stringBody(k, key));
+    base::Result<Value> v = item(depth);
+    if (!v.has_value()) return v.error();
+    entries.emplace_back(std::move(key), std::move(v).value());
+    return base::Result<void>::success();
   }
 
   // The tag's content is read here rather than through item(): both tags
