@@ -60,7 +60,12 @@ VTDaemonClientPtr VTDaemonClient::initWithServiceName(const char* name) {
 }
 
 VTDaemonClient::~VTDaemonClient() {
-  if (vantreld_ != nullptr) vantreld_->cancel();
+  if (vantreld_ != nullptr) {
+    // Our own cancel is not a communications error: without this, a tool
+    // that got its answer could log one on its way out.
+    vantreld_->setEventHandler(nullptr);
+    vantreld_->cancel();
+  }
   // The last reference may be dropped inside a reply handler, that is on the
   // reply queue's own worker, where a queue cannot be destroyed.
   lmo::releaseQueue(std::move(replyQueue_));

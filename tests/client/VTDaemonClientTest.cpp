@@ -13,6 +13,7 @@
 #include <utility>
 
 #include "base/Log.h"
+#include "lmo/IoLoop.h"
 #include "lmo/Listener.h"
 #include "lmo/Protocol.h"
 #include "tests/support/TempDir.h"
@@ -310,6 +311,24 @@ TEST(VTDaemonClient, EachHandlerRunsOnceOnTheReplyQueue) {
     ASSERT_EQ(late.size(), 1u) << name;
     EXPECT_EQ(late[0].first.error(), lmo::ErrorEvent::kConnectionInvalid) << name;
   }
+}
+
+TEST(VTDaemonClient, AProxyThatGoesAfterItsAnswerLogsNoError) {
+  testing::TempDir dir;
+  FakeDaemon daemon(dir.file("svc"));
+  daemon.script({{Answer::kReply, {{protocol::kKeyMatches, Array{}}}}});
+  base::LogCapture log;
+  auto client = VTDaemonClient::initWithServiceName(dir.file("svc").c_str());
+  const lmo::QueuePtr queue = client->replyQueue();
+  auto replies = std::make_shared<Replies>();
+  ASSERT_TRUE(client->matchPlugIns({}, protocol::DiscoveryFlags::kNone, recordInto(replies, queue))
+                  .has_value());
+  ASSERT_EQ(replies->waitFor(1).size(), 1u);
+  client.reset();
+  // The cancel runs on the I/O thread, which hands its event to the queue.
+  lmo::IoLoop::shared().runAndWait([] {});
+  queue->sync([] {});
+  EXPECT_EQ(log.count("Communications error: connection invalid"), 0u);
 }
 
 TEST(VTDaemonClient, SendSyncWaitsForItsOwnReplyOrGivesUp) {
