@@ -2,6 +2,8 @@
 
 #include <unistd.h>
 
+#include <chrono>
+
 #include "base/Format.h"
 #include "daemon/Limits.h"
 #include "daemon/Transaction.h"
@@ -74,10 +76,16 @@ void VTDLmoClient::handleMessage(const lmo::IncomingMessage& message) {
   probes::requestInput(pid_, [&] { return lmo::describe(message.body()); });
   std::shared_ptr<Transaction> transaction =
       Transaction::initWithRequest(message, shared_from_this());
-  server_->submitRequest([transaction] {
-    base::LogBudgetScope charged(transaction->client()->logBudget());
-    transaction->client()->countRequest();
-    transaction->dispatch();
+  server_->submitRequest([transaction, client = shared_from_this()]() mutable {
+    const auto started = std::chrono::steady_clock::now();
+    {
+      base::LogBudgetScope charged(client->logBudget());
+      client->countRequest();
+      transaction->dispatch();
+      // What the request built goes now, unless it goes on elsewhere.
+      transaction.reset();
+    }
+    client->server()->requestFinished(std::chrono::steady_clock::now() - started);
   });
 }
 

@@ -1,5 +1,6 @@
 #include "daemon/VTDServer.h"
 
+#include <malloc.h>
 #include <unistd.h>
 
 #include "base/Log.h"
@@ -96,6 +97,13 @@ void VTDServer::logFormatArguments(int level, std::string_view fmt, const base::
 
 void VTDServer::submitWork(std::function<void()> work) {
   mainQueue_->async(std::move(work));
+}
+
+void VTDServer::requestFinished(std::chrono::steady_clock::duration took) {
+  mainQueue_->assertCurrent();
+  // A trim takes a few milliseconds on a large heap: small next to the
+  // requests that leave much behind, too much for every request.
+  if (took >= kTrimAfterRequestTime) ::malloc_trim(0);
 }
 
 void VTDServer::submitRequest(std::function<void()> work) {

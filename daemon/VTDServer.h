@@ -20,6 +20,7 @@
 // and transactions hold it strongly, the listener only weakly.
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -46,6 +47,10 @@ using VTDPlugInHoldPtr = std::shared_ptr<VTDPlugInHold>;
 // Whether an operation's debug lines and message dumps are written.
 inline constexpr uint32_t kVerboseDebug = 1;
 inline constexpr uint32_t kVerboseDumps = 2;
+
+// A request that took at least this long has its freed memory given back to
+// the system when it ends (requestFinished).
+inline constexpr std::chrono::milliseconds kTrimAfterRequestTime{20};
 
 class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelegate {
  public:
@@ -97,6 +102,11 @@ class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelega
 
   // Runs work on the service queue, after the work submitted before it.
   void submitWork(std::function<void()> work);
+  // Called on the service queue after each request's work, with how long it
+  // took: after a long one (a large reply, many bundles read) what it freed
+  // is given back to the system, since requests run on several threads and
+  // each thread's heap would otherwise keep its peak.
+  void requestFinished(std::chrono::steady_clock::duration took);
   // The same for a request's work, from the connection's event handler:
   // run on the calling thread when the queue is idle. The caller must hold
   // no lock the work could need.
