@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "lmo/Protocol.h"
@@ -39,6 +40,9 @@ using FormPtr = std::shared_ptr<Form>;
 struct MatchState {
   protocol::DiscoveryFlags flags = protocol::DiscoveryFlags::kNone;
   std::vector<FormPtr> results;
+  // Form identifier -> its forms in results, in results' order: duplicate
+  // resolution looks only at these, not at every form so far.
+  std::unordered_map<std::string, std::vector<FormPtr>> byIdentifier;
   // Replaced identifier -> the form of the plug-in that replaces it.
   std::map<std::string, FormPtr, std::less<>> replacements;
   lmo::Array exclusions;

@@ -88,14 +88,19 @@ bool resolveDuplicates(const registry::VTDPlugIn& plugIn, const std::string& ide
   const bool keepVersions = protocol::has(state.flags, DiscoveryFlags::kVersions);
   const bool keepDuplicates =
       keepVersions && protocol::has(state.flags, DiscoveryFlags::kDuplicates);
-  for (size_t i = 0; i < state.results.size(); ++i) {
-    const Form& earlier = *state.results[i];
-    if (earlier.identifier() != identifier) continue;
+  const auto same = state.byIdentifier.find(identifier);
+  if (same == state.byIdentifier.end()) return true;
+  std::vector<FormPtr>& forms = same->second;
+  for (size_t i = 0; i < forms.size(); ++i) {
+    const Form& earlier = *forms[i];
     const int c =
         model::compareVersionString(version, versionText(earlier.body.get(protocol::kFormVersion)));
     if (keepVersions && (c != 0 || keepDuplicates)) continue;
     const bool replaceEarlier = c > 0 || (c == 0 && isNewer(plugIn, earlier));
-    if (replaceEarlier) state.results.erase(state.results.begin() + static_cast<ptrdiff_t>(i));
+    if (replaceEarlier) {
+      std::erase(state.results, forms[i]);
+      forms.erase(forms.begin() + static_cast<ptrdiff_t>(i));
+    }
     return replaceEarlier;
   }
   return true;
@@ -157,6 +162,7 @@ void Transaction::visitCandidate(const registry::VTDPlugIn& plugIn, MatchState& 
   }
   auto kept = std::make_shared<Form>(Form{std::move(form)});
   state.results.push_back(kept);
+  state.byIdentifier[std::string(kept->identifier())].push_back(kept);
   noteReplacements(plugIn, kept, state);
 }
 

@@ -185,6 +185,21 @@ TEST_F(Discovery, DuplicatesResolvedByVersion) {
   }
 }
 
+// A later duplicate is weighed against the one that has won so far, not one
+// that was replaced: visited (in path order) as 1, 2, 1.5, only 2 is left.
+TEST_F(Discovery, ALaterDuplicateMeetsTheWinnerSoFar) {
+  addPlugIn("E1", "com.e", {{"QXExtensionVersion", "1"}});
+  addPlugIn("E2", "com.e", {{"QXExtensionVersion", "2"}});
+  addPlugIn("E3", "com.e", {{"QXExtensionVersion", "1.5"}});
+  Ids found;
+  for (const Value& form :
+       matches({{protocol::kKeyRules, Dictionary{{"QXExtensionIdentifier", "com.e"}}},
+                {protocol::kKeyFlags, u64(DiscoveryFlags::kNone)}})) {
+    found.insert(*form.getIfDictionary()->get(protocol::kFormVersion).getIfString());
+  }
+  EXPECT_EQ(found, Ids{"2"});
+}
+
 // Equal versions are settled by registration time, in whole seconds, except
 // that a system plug-in visited after a non-system one always wins. The
 // expected winner of each pair is worked out from the visit order, which the
