@@ -68,7 +68,8 @@ struct ParsedRow {
   base::Result<lmo::Dictionary> entitlements;
   ContentDigest digest;
   // Made beside the parse when the row's application is loaded and its
-  // container exists; otherwise made (and they) when the row is loaded.
+  // container exists; otherwise made, with whichever of those is missing,
+  // when the row is loaded.
   PlugInRecordPtr record;
 };
 
@@ -138,10 +139,16 @@ PlugInRecordPtr Omnidex::State::recordIfReady(
     if (entry == nullptr) return nullptr;
     app = entry->record;
   }
+  return recordOf(row, parsed, std::move(app), containers.pathFor(row.uuid));
+}
+
+PlugInRecordPtr Omnidex::State::recordOf(const PlugInRow& row, const ParsedRow& parsed,
+                                         ApplicationRecordPtr app,
+                                         std::optional<std::string> container) {
   return makePlugInRecord(
       row.path, parsed.metadata.value(), parsed.entitlements.value(),
       PlugInIdentity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}}, std::move(app),
-      containers.pathFor(row.uuid));
+      std::move(container));
 }
 
 void Omnidex::State::loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
@@ -156,11 +163,11 @@ void Omnidex::State::loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
                             parsed.digest});
     return;
   }
-  const base::Result<PlugInInfo>& metadata = parsed.metadata;
-  if (!metadata.has_value()) return logUnreadableRow(row.path, metadata.error().description());
-  const base::Result<lmo::Dictionary>& entitlements = parsed.entitlements;
-  if (!entitlements.has_value()) {
-    return logUnreadableRow(row.path, entitlements.error().description());
+  if (!parsed.metadata.has_value()) {
+    return logUnreadableRow(row.path, parsed.metadata.error().description());
+  }
+  if (!parsed.entitlements.has_value()) {
+    return logUnreadableRow(row.path, parsed.entitlements.error().description());
   }
   ApplicationRecordPtr app;
   if (std::optional<std::string> appPath = containingApplicationPath(row.path)) {
@@ -175,15 +182,12 @@ void Omnidex::State::loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
       indexes.putApplication(ApplicationEntry{app, {}, bundle.digest});
     }
   }
-  const PlugInIdentity identity{row.uuid, row.originalIdentifier, lmo::Date{row.registered}};
   // Containers are made at registration; one removed since is made again.
   std::optional<std::string> container = existingContainers.contains(row.uuid)
                                              ? containers.pathFor(row.uuid)
                                              : containerOrLog(containers, row.uuid, row.path);
-  PlugInRecordPtr record = makePlugInRecord(row.path, metadata.value(), entitlements.value(),
-                                            identity, app, std::move(container));
-  indexes.put(
-      PlugInEntry{std::move(record), row.isExplicit, std::move(row.fingerprint), parsed.digest});
+  indexes.put(PlugInEntry{recordOf(row, parsed, std::move(app), std::move(container)),
+                          row.isExplicit, std::move(row.fingerprint), parsed.digest});
 }
 
 base::Result<std::unique_ptr<Watcher>> Omnidex::State::makeWatcher() {

@@ -98,6 +98,9 @@ struct Omnidex::State {
   // while nothing writes them.
   PlugInRecordPtr recordIfReady(const PlugInRow& row, const ParsedRow& parsed,
                                 const std::unordered_set<base::Uuid>& existingContainers) const;
+  // row's record, its bytes parsed successfully, in app and container.
+  static PlugInRecordPtr recordOf(const PlugInRow& row, const ParsedRow& parsed,
+                                  ApplicationRecordPtr app, std::optional<std::string> container);
   // row, its bytes parsed already (off the write path, in parallel).
   void loadPlugIn(PlugInRow&& row, ParsedRow&& parsed,
                   const std::unordered_set<base::Uuid>& existingContainers);
