@@ -95,10 +95,6 @@ void VTDServer::logFormatArguments(int level, std::string_view fmt, const base::
   base::writeLog(priority, base::formatArgs(fmt, args, count));
 }
 
-void VTDServer::submitWork(std::function<void()> work) {
-  mainQueue_->async(std::move(work));
-}
-
 void VTDServer::requestFinished(std::chrono::steady_clock::duration took) {
   mainQueue_->assertCurrent();
   // A trim takes a few milliseconds on a large heap: small next to the

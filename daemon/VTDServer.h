@@ -6,11 +6,11 @@
 // Queues:
 //   "lmo"        new connections and every client connection's events; only
 //                client objects and transactions are made there.
-//   "service"    every transaction, one at a time (submitRequest,
-//                submitWork). A request may run on the thread that
-//                delivered it (the I/O thread, or the "lmo" queue's) when
-//                the queue is idle, so work on it must never wait for the
-//                I/O thread or the "lmo" queue.
+//   "service"    every transaction, one at a time (submitRequest). A
+//                request may run on the thread that delivered it (the I/O
+//                thread, or the "lmo" queue's) when the queue is idle, so
+//                work on it must never wait for the I/O thread or the
+//                "lmo" queue.
 //   "serverSync" the list of holds; entered synchronously from the service
 //                queue and from connection events, never from itself.
 // The database queue ("VTDatabase", inherited) is entered from the service
@@ -100,16 +100,15 @@ class VTDServer : public registry::VTDatabase, public registry::VTDatabaseDelega
   void logFormatArguments(int level, std::string_view fmt, const base::FormatArg* args,
                           size_t count) const;
 
-  // Runs work on the service queue, after the work submitted before it.
-  void submitWork(std::function<void()> work);
   // Called on the service queue after each request's work, with how long it
   // took: after a long one (a large reply, many bundles read) what it freed
   // is given back to the system, since requests run on several threads and
   // each thread's heap would otherwise keep its peak.
   void requestFinished(std::chrono::steady_clock::duration took);
-  // The same for a request's work, from the connection's event handler:
-  // run on the calling thread when the queue is idle. The caller must hold
-  // no lock the work could need.
+  // Runs a request's work on the service queue, after the work submitted
+  // before it; from the connection's event handler, on the calling thread
+  // when the queue is idle. The caller must hold no lock the work could
+  // need.
   void submitRequest(std::function<void()> work);
 
   // ---- Holds (each synchronous; never call them on syncQueue()) ----

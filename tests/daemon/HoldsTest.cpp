@@ -146,7 +146,7 @@ TEST_F(Holds, ReleasedWhenTheClientGoesAwayBeforeItIsDeclaredDead) {
   // A request queued behind a blocked service queue reaches it only after
   // the client is dead: it must then do nothing, not even reply.
   std::promise<void> release;
-  server_->submitWork([released = release.get_future().share()] { released.wait(); });
+  server_->mainQueue()->async([released = release.get_future().share()] { released.wait(); });
   (void)connection->send(Dictionary{
       {protocol::kKeyRequest, protocol::kRequestAnnotate},
       {protocol::kKeyVersion, u64(protocol::kCurrentVersion)},
