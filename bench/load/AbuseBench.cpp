@@ -76,24 +76,18 @@ struct Options {
 Options parseOptions(int argc, char** argv) {
   Options options;
   const std::optional<std::string> problem =
-      walkArguments(argc, argv, &options.json,
-                    [&](std::string_view name, const char* value,
-                        std::optional<double> number) -> std::optional<std::string> {
-                      if (name == "--vantreld") {
-                        options.vantreld = value;
-                        return std::nullopt;
-                      }
-                      if (!number) return "not a number: " + std::string(value);
+      walkArguments(argc, argv, &options.json, &options.vantreld,
+                    [&](std::string_view name, double number) -> std::optional<std::string> {
                       if (name == "--idle") {
-                        options.idle = static_cast<int>(*number);
+                        options.idle = static_cast<int>(number);
                       } else if (name == "--stalled") {
-                        options.stalled = static_cast<int>(*number);
+                        options.stalled = static_cast<int>(number);
                       } else if (name == "--pipeliners") {
-                        options.pipeliners = static_cast<int>(*number);
+                        options.pipeliners = static_cast<int>(number);
                       } else if (name == "--requests") {
-                        options.requests = std::max(1, static_cast<int>(*number));
+                        options.requests = std::max(1, static_cast<int>(number));
                       } else if (name == "--linger") {
-                        options.linger = *number;
+                        options.linger = number;
                       } else {
                         return "unknown option " + std::string(name);
                       }

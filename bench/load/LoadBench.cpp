@@ -114,28 +114,22 @@ struct Options {
 Options parseOptions(int argc, char** argv) {
   Options options;
   const std::optional<std::string> problem =
-      walkArguments(argc, argv, &options.json,
-                    [&](std::string_view name, const char* value,
-                        std::optional<double> number) -> std::optional<std::string> {
-                      if (name == "--vantreld") {
-                        options.vantreld = value;
-                        return std::nullopt;
-                      }
-                      if (!number) return "not a number";
+      walkArguments(argc, argv, &options.json, &options.vantreld,
+                    [&](std::string_view name, double number) -> std::optional<std::string> {
                       if (name == "--apps") {
-                        options.apps = static_cast<int>(*number);
+                        options.apps = static_cast<int>(number);
                       } else if (name == "--requests") {
-                        options.requests = static_cast<uint64_t>(*number);
+                        options.requests = static_cast<uint64_t>(number);
                       } else if (name == "--match-requests") {
-                        options.matchRequests = static_cast<uint64_t>(*number);
+                        options.matchRequests = static_cast<uint64_t>(number);
                       } else if (name == "--seconds") {
-                        options.seconds = *number;
+                        options.seconds = number;
                       } else if (name == "--rounds") {
-                        options.rounds = static_cast<int>(*number);
+                        options.rounds = static_cast<int>(number);
                       } else if (name == "--starts") {
-                        options.starts = static_cast<int>(*number);
+                        options.starts = static_cast<int>(number);
                       } else if (name == "--cache") {
-                        options.cacheLimit = static_cast<uint32_t>(*number);  // 0: nothing cached
+                        options.cacheLimit = static_cast<uint32_t>(number);  // 0: nothing cached
                       } else {
                         return "unknown option";
                       }
